@@ -1,0 +1,89 @@
+#pragma once
+
+// One kernel memory object as seen from all targets at once.
+//
+// Pages are de-duplicated in the object's own offset space: every region
+// brings its offset into the object, its length and its page-class sizes,
+// and the object keeps a sorted list of disjoint ranges. Overlap is judged
+// on whole pages (start rounded down, end rounded up to the page size of
+// the region's target), so two ranges that merely touch at a page boundary
+// collapse into one node, while each node keeps its exact byte range.
+// When ranges overlap, a size becomes the sum less the shared page bytes,
+// but never less than the larger of the two (the "max rule"): the overlap
+// is an upper bound on what the two can have in common.
+//
+// The object refers to its regions without owning them (their target owns
+// them); the regions must outlive the object's use.
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <utility>
+
+#include "model/memory_region.h"
+#include "model/pointer_set.h"
+
+// One disjoint range of the object's offset space with the bytes of each
+// page class attributed to it.
+struct VSRangeListNode {
+    std::uint64_t offset = 0;
+    std::uint64_t size = 0; // exact, not rounded to pages
+    std::uint64_t cleanSize = 0;
+    std::uint64_t dirtySize = 0;
+    std::uint64_t swappedSize = 0;
+    std::uint64_t reclaimableSize = 0;
+    std::uint64_t wiredSize = 0;
+    std::unique_ptr<VSRangeListNode> next;
+};
+
+namespace vs {
+using RegionSet = PointerSet<VSMemoryRegion>;
+}
+
+class VSMemoryObject {
+public:
+    VSMemoryObject() = default;
+    ~VSMemoryObject();
+    VSMemoryObject(const VSMemoryObject &) = delete;
+    VSMemoryObject &operator=(const VSMemoryObject &) = delete;
+
+    // Records the region and merges its range into the range list. pageSize
+    // is the page size of the region's target, a power of two. A region with
+    // object_id 0 is recorded (and may name the object) but adds no bytes.
+    // Makes the totals stale until the next calculateSizes().
+    void addRegion(VSMemoryRegion *region, std::uint64_t pageSize);
+
+    // Brings the five totals up to date from the range list; does nothing
+    // when they already are.
+    void calculateSizes();
+
+    // Meaningful after calculateSizes() and until the next addRegion().
+    std::uint64_t totalDirtySize() const { return _totalDirtySize; }
+    std::uint64_t totalCleanSize() const { return _totalCleanSize; }
+    std::uint64_t totalReclaimableSize() const { return _totalReclaimableSize; }
+    std::uint64_t totalSwappedSize() const { return _totalSwappedSize; }
+    std::uint64_t totalWiredSize() const { return _totalWiredSize; }
+
+    // Name of the first added region that had one; nullopt until then.
+    const std::optional<std::string> &name() const { return _name; }
+    void setName(std::optional<std::string> name) { _name = std::move(name); }
+
+    // Every region added, in the order of first addition (non-owning).
+    const vs::RegionSet &memoryRegions() const { return _memoryRegions; }
+    void setMemoryRegions(vs::RegionSet regions) { _memoryRegions = std::move(regions); }
+
+    // The range list, for inspection (tests, debugging): first node or null.
+    const VSRangeListNode *rangeListHead() const { return _rangeListHead.get(); }
+
+private:
+    vs::RegionSet _memoryRegions;
+    std::uint64_t _totalDirtySize = 0;
+    std::uint64_t _totalCleanSize = 0;
+    std::uint64_t _totalReclaimableSize = 0;
+    std::uint64_t _totalSwappedSize = 0;
+    std::uint64_t _totalWiredSize = 0;
+    std::optional<std::string> _name;
+    std::unique_ptr<VSRangeListNode> _rangeListHead;
+    bool _accurateSizes = false;
+};
