@@ -19,3 +19,7 @@ VSPlatform &VSPlatform::current() {
 void VSPlatform::setCurrent(VSPlatform *platform) {
     installedPlatform.store(platform, std::memory_order_release);
 }
+
+VSPlatform *VSPlatform::installed() {
+    return installedPlatform.load(std::memory_order_acquire);
+}

@@ -360,6 +360,8 @@ public:
     // nothing is installed. setCurrent(nullptr) uninstalls.
     static VSPlatform &current();
     static void setCurrent(VSPlatform *platform);
+    // The installed platform or null, for code that restores a previous one.
+    static VSPlatform *installed();
 
     // Runs the callback exactly once per flag, also under concurrent first use.
     template <class Callback>
