@@ -1,24 +1,193 @@
 #include "cli/run.h"
 
 #include <cstdio>
+#include <filesystem>
+#include <memory>
+#include <set>
+#include <utility>
+
+#include "analysis/vestage.h"
+#include "output/text_formatter.h"
+#include "targets/platform/linux/linux_platform.h"
+#include "targets/process.h"
 
 namespace vs {
 
-int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArguments) {
-    // Every bare argument ends up as a target, a pid or a process
-    // description (or ends the run), so any of them means there is
-    // something to analyse.
-    bool haveArgumentTargets = !bareArguments.empty();
+namespace {
 
-    if (options.pidTable.empty() && !haveArgumentTargets && options.processDescriptions.empty() &&
+// State the heapfile arguments share with the rest of the sequence: the
+// breakdown mode is switched for the whole run, so every heapfile and
+// --physVestage must agree on it.
+struct BreakDownMode {
+    bool enabled = false;
+    bool fixed = false;
+};
+
+std::vector<std::string> asVector(const std::set<std::string> &descriptions) {
+    return {descriptions.begin(), descriptions.end()};
+}
+
+// A bare argument naming an existing file: a heapfile, or else one more
+// process description. Returns an exit status when the run must end.
+std::optional<int> takeExistingFileArgument(const std::string &argument, VSRunOptions &options) {
+    std::optional<VSPidTable> resolved = VSProcess::pidsForStringDescriptions({argument});
+    if (resolved && !resolved->empty()) {
+        for (auto &[pid, name] : *resolved) {
+            options.pidTable[pid] = name;
+        }
+        return std::nullopt;
+    }
+    std::fprintf(stderr, "Error opening heapfile %s: %s\n", argument.c_str(), "heapfiles are not supported yet");
+    return 1;
+}
+
+// The corpse checks: a name, a positive pid and a usable corpse port.
+std::optional<int> checkCorpseArguments(const VSRunOptions &options, uint32_t &corpsePort) {
+    if (!options.corpseName || static_cast<int32_t>(options.corpsePid) <= 0) {
+        std::fputs("Invalid arguments for corpse mode\n", stderr);
+        printCorpseUsage();
+        return 1;
+    }
+    std::vector<uint32_t> ports;
+    VSReturnCode code = VSPlatform::current().ports_lookup(ports);
+    if (code != kReturnSuccess || ports.empty() || ports.front() == kPortNull || ports.front() == kPortDead) {
+        std::fputs("Failed to retrieve corpse port\n", stderr);
+        printCorpseUsage();
+        return 1;
+    }
+    corpsePort = ports.front();
+    return std::nullopt;
+}
+
+}  // namespace
+
+int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArguments) {
+    VSTargetMap targetMap;
+    BreakDownMode breakDown{options.breakDownRequested, options.breakDownRequested};
+
+    for (const std::string &argument : bareArguments) {
+        std::error_code error;
+        if (!std::filesystem::exists(argument, error)) {
+            options.processDescriptions.insert(argument);
+            continue;
+        }
+        if (std::optional<int> status = takeExistingFileArgument(argument, options)) {
+            return *status;
+        }
+    }
+
+    if (options.pidTable.empty() && targetMap.empty() && options.processDescriptions.empty() &&
         !options.allProcesses && !options.corpseMode) {
         std::fputs("Must specify at least one process or heapfile\n", stderr);
         printUsage();
         return 1;
     }
 
-    std::fputs("not yet\n", stderr);
-    return 1;
+    VSPlatform &platform = VSPlatform::current();
+    if (options.allProcesses && platform.effective_user_id() != 0) {
+        std::fputs("Must run as root.\n", stderr);
+        printUsage();
+        return 1;
+    }
+
+    uint32_t corpsePort = kPortNull;
+    if (options.corpseMode) {
+        if (std::optional<int> status = checkCorpseArguments(options, corpsePort)) {
+            return *status;
+        }
+    }
+
+    if (breakDown.enabled) {
+        VSVestage::setBreakDownPhysVestage(true);
+    }
+
+    std::set<int32_t> excluded{platform.own_pid()};
+    if (options.corpseMode) {
+        excluded.insert(static_cast<int32_t>(options.corpsePid));
+    }
+    if (!options.excludeDescriptions.empty()) {
+        if (std::optional<VSPidTable> pids = VSProcess::pidsForStringDescriptions(asVector(options.excludeDescriptions))) {
+            for (const auto &entry : *pids) {
+                excluded.insert(entry.first);
+            }
+        }
+    }
+
+    if (options.allProcesses) {
+        std::optional<VSTargetMap> all = VSProcess::allProcessesExcludingPids(excluded);
+        targetMap = all ? std::move(*all) : VSTargetMap{};
+    } else {
+        VSPidTable &pidTable = options.pidTable;
+        if (!options.processDescriptions.empty()) {
+            std::vector<std::string> errors;
+            std::optional<VSPidTable> resolved =
+                VSProcess::pidsForStringDescriptions(asVector(options.processDescriptions), &errors);
+            if (resolved) {
+                for (auto &[pid, name] : *resolved) {
+                    pidTable[pid] = std::move(name);
+                }
+            }
+            for (const std::string &error : errors) {
+                std::fprintf(stderr, "%s\n", error.c_str());
+            }
+        }
+        for (int32_t pid : excluded) {
+            pidTable.erase(pid);
+        }
+        if (options.targetChildren) {
+            std::vector<int32_t> parents;
+            for (const auto &entry : pidTable) {
+                parents.push_back(entry.first);
+            }
+            if (std::optional<std::vector<int32_t>> family = VSProcess::childPidsForPids(parents)) {
+                for (int32_t pid : *family) {
+                    pidTable[pid] = std::nullopt;
+                }
+            }
+        }
+        for (const auto &[pid, name] : pidTable) {
+            std::unique_ptr<VSProcess> process = VSProcess::processWithPid(pid);
+            if (process) {
+                targetMap[pid] = std::move(process);
+            } else if (name) {
+                std::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n", name->c_str(),
+                             static_cast<long>(pid));
+            } else {
+                std::fprintf(stderr, "Unable to analyze process with pid %ld (try as root?)\n", static_cast<long>(pid));
+            }
+        }
+    }
+
+    if (targetMap.empty()) {
+        std::fputs("Unable to find any processes matching the supplied process names or pids (try as root?)\n",
+                   stderr);
+        return 1;
+    }
+
+    if (options.skipIdleExitClean) {
+        targetMap = VSProcess::removeIdleExitCleanProcessesFrom(std::move(targetMap));
+    }
+
+    std::vector<std::unique_ptr<VSProcess>> targets;
+    targets.reserve(targetMap.size());
+    for (auto &entry : targetMap) {
+        targets.push_back(std::move(entry.second));
+    }
+    VSVestage vestage(std::move(targets));
+
+    std::unique_ptr<InterruptSource> interrupt = VSVestage::installCancelHandler([&vestage] {
+        vestage.cancel();
+        std::fputs("Exiting early due to SIGINT\n", stderr);
+    });
+    vestage.gatherData();
+    if (interrupt) {
+        interrupt->cancel();
+        interrupt.reset();
+    }
+
+    vestage.addOutputFormatter(std::make_unique<VSOutputFormatterText>(options.summaryFormat, options.outputOptions));
+    vestage.printOutputVerbose(options.verbose, options.summarize);
+    return 0;
 }
 
 }  // namespace vs
@@ -28,5 +197,7 @@ int vsMain(int argc, char **argv) {
     if (scan.exitStatus) {
         return *scan.exitStatus;
     }
+    static VSLinuxPlatform linuxPlatform;
+    VSPlatform::setCurrent(&linuxPlatform);
     return vs::runSequence(scan.options, scan.bareArguments);
 }
