@@ -3,18 +3,16 @@
 // own diagnostics name it; the locale is fixed so they are not translated.
 
 #include <gtest/gtest.h>
-#include <poll.h>
-#include <spawn.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include <cstring>
 #include <string>
 #include <vector>
 
-extern char **environ;
+#include "tests/support/run_program.h"
 
 namespace {
+
+using vs::test::RunResult;
+using vs::test::runProgram;
 
 const char *const kUsage =
     "Gather memory information about a process or set of processes\n"
@@ -43,81 +41,6 @@ std::string badPid(const std::string &text) {
            "name.\n";
 }
 
-struct RunResult {
-    std::string out;
-    std::string err;
-    int status = -1;
-};
-
-RunResult runProgram(const std::vector<std::string> &args) {
-    std::string path = VESTAGE_TEST_BIN_DIR "/vestage";
-    std::vector<char *> argv;
-    std::string name = "vestage";
-    argv.push_back(name.data());
-    std::vector<std::string> argStorage(args);
-    for (auto &a : argStorage) argv.push_back(a.data());
-    argv.push_back(nullptr);
-
-    // Same environment, minus anything that changes option parsing or its language.
-    std::vector<std::string> envStorage;
-    for (char **e = environ; *e; ++e) {
-        if (std::strncmp(*e, "POSIXLY_CORRECT=", 16) != 0 && std::strncmp(*e, "LC_", 3) != 0 &&
-            std::strncmp(*e, "LANG", 4) != 0) {
-            envStorage.emplace_back(*e);
-        }
-    }
-    envStorage.emplace_back("LC_ALL=C");
-    std::vector<char *> envp;
-    for (auto &e : envStorage) envp.push_back(e.data());
-    envp.push_back(nullptr);
-
-    int outPipe[2], errPipe[2];
-    EXPECT_EQ(pipe(outPipe), 0);
-    EXPECT_EQ(pipe(errPipe), 0);
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_adddup2(&actions, outPipe[1], 1);
-    posix_spawn_file_actions_adddup2(&actions, errPipe[1], 2);
-    for (int fd : {outPipe[0], outPipe[1], errPipe[0], errPipe[1]}) {
-        posix_spawn_file_actions_addclose(&actions, fd);
-    }
-    pid_t child = -1;
-    int spawnError = posix_spawn(&child, path.c_str(), &actions, nullptr, argv.data(), envp.data());
-    posix_spawn_file_actions_destroy(&actions);
-    close(outPipe[1]);
-    close(errPipe[1]);
-
-    RunResult result;
-    if (spawnError != 0) {
-        ADD_FAILURE() << "cannot start " << path << ": " << std::strerror(spawnError);
-        close(outPipe[0]);
-        close(errPipe[0]);
-        return result;
-    }
-    // Drain both pipes together so a chatty child cannot block on a full one.
-    struct pollfd fds[2] = {{outPipe[0], POLLIN, 0}, {errPipe[0], POLLIN, 0}};
-    std::string *sinks[2] = {&result.out, &result.err};
-    int open = 2;
-    while (open > 0) {
-        if (poll(fds, 2, -1) < 0) break;
-        for (int i = 0; i < 2; ++i) {
-            if (fds[i].fd < 0 || !(fds[i].revents & (POLLIN | POLLHUP | POLLERR))) continue;
-            char buffer[4096];
-            ssize_t n = read(fds[i].fd, buffer, sizeof buffer);
-            if (n > 0) {
-                sinks[i]->append(buffer, static_cast<size_t>(n));
-            } else {
-                close(fds[i].fd);
-                fds[i].fd = -1;
-                --open;
-            }
-        }
-    }
-    int waitStatus = 0;
-    waitpid(child, &waitStatus, 0);
-    result.status = WIFEXITED(waitStatus) ? WEXITSTATUS(waitStatus) : 128 + WTERMSIG(waitStatus);
-    return result;
-}
 
 struct ProgramCase {
     std::vector<std::string> args;
