@@ -57,8 +57,11 @@ std::string resolvedPath(const std::string &path) {
 }  // namespace
 
 VSUserProcess::~VSUserProcess() {
-    if (_ownsTask && _task != vs::kTaskHandleNone) {
-        VSPlatform::current().release_task_handle(_task);
+    // A target that outlives its platform (a test that uninstalled it) has
+    // nothing left to give the handle back to.
+    VSPlatform *platform = VSPlatform::installed();
+    if (_ownsTask && _task != vs::kTaskHandleNone && platform != nullptr) {
+        platform->release_task_handle(_task);
     }
 }
 
