@@ -1,0 +1,309 @@
+// The kernel target's queries and the corpse hand-over of the Linux layer.
+//
+// Zones are the slab caches of /proc/slabinfo. Wired memory by site comes
+// from three sources: /proc/meminfo for what the kernel keeps per purpose
+// (kernel stacks, page tables, per-cpu areas, locked user pages ...),
+// /proc/modules for loaded modules, and /proc/vmallocinfo summed per
+// calling code address, named through /proc/kallsyms. meminfo totals
+// become the counter entries.
+
+#include "targets/platform/linux/kernel_text.h"
+#include "targets/platform/linux/linux_platform.h"
+#include "targets/platform/linux/proc_reader.h"
+#include "targets/platform/linux/proc_text.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <fcntl.h>
+#include <unistd.h>
+#include <unordered_map>
+
+struct VSLinuxPlatform::KernelArrays {
+    std::vector<VSKernelZoneName> zoneNames;
+    std::vector<VSKernelZoneInfo> zoneInfos;
+    std::vector<VSKernelSiteInfo> siteInfos;
+    bool zoneNamesHeld = true;
+    bool zoneInfosHeld = true;
+    bool siteInfosHeld = true;
+};
+
+namespace {
+
+// meminfo lines that are wired kernel memory of one purpose, with the
+// kernel-site tag they are reported under.
+struct MeminfoSite {
+    const char *name;
+    uint64_t tag;
+};
+constexpr MeminfoSite kMeminfoSites[] = {
+    {"KernelStack", 8},   // stacks of all threads
+    {"Percpu", 9},        // per-cpu areas
+    {"SecPageTables", 10}, // page tables of secondary MMUs (IOMMU, KVM)
+    {"PageTables", 11},   // process page tables
+    {"Zswap", 15},        // compressed pages
+    {"Mlocked", 24},      // user pages locked in memory
+};
+
+// meminfo totals reported as counters, with their counter index.
+struct MeminfoCounter {
+    const char *name;
+    uint64_t index;
+};
+constexpr MeminfoCounter kMeminfoCounters[] = {
+    {"MemTotal", 0},    // pages the kernel manages
+    {"Unevictable", 2}, // pages that cannot be reclaimed
+    {"VmallocUsed", 6}, // the kernel's own address space in use
+    {"Slab", 7},        // all zones together
+};
+
+// Sites whose caller could not be found in kallsyms get made-up site
+// numbers up here, far from any kernel address or small index.
+constexpr uint64_t kUnresolvedSiteBase = 1ull << 40;
+
+void setName(char (&field)[80], std::string_view text) {
+    std::memset(field, 0, sizeof field);
+    std::memcpy(field, text.data(), std::min(sizeof field - 1, text.size()));
+}
+
+class KallsymsSymbolicator : public VSKernelSymbolicator {
+public:
+    explicit KallsymsSymbolicator(std::shared_ptr<const std::vector<vs::KernelSymbol>> symbols)
+        : _symbols(std::move(symbols)) {}
+
+    std::optional<std::string> symbol_name_at(uint64_t address) const override {
+        auto it = std::upper_bound(
+            _symbols->begin(), _symbols->end(), address,
+            [](uint64_t a, const vs::KernelSymbol &s) { return a < s.address; });
+        if (it == _symbols->begin()) {
+            return std::nullopt;
+        }
+        return std::prev(it)->name;
+    }
+
+    std::optional<VSSourceLocation> source_location_at(uint64_t) const override {
+        return std::nullopt; // the running kernel carries no line tables
+    }
+
+private:
+    std::shared_ptr<const std::vector<vs::KernelSymbol>> _symbols;
+};
+
+std::shared_ptr<const std::vector<vs::KernelSymbol>> loadKallsyms() {
+    static std::mutex mutex;
+    static std::shared_ptr<const std::vector<vs::KernelSymbol>> cached;
+    std::lock_guard<std::mutex> lock(mutex);
+    if (!cached) {
+        vs::ReadBuffer buffer;
+        std::string_view text;
+        if (vs::readFileAt(AT_FDCWD, "/proc/kallsyms", buffer, text) == 0) {
+            cached = std::make_shared<const std::vector<vs::KernelSymbol>>(vs::parseKallsyms(text));
+        } else {
+            cached = std::make_shared<const std::vector<vs::KernelSymbol>>();
+        }
+    }
+    return cached;
+}
+
+bool slabReclaimable(const std::string &name) {
+    const std::string path = "/sys/kernel/slab/" + name + "/reclaim_account";
+    char text[8] = {};
+    const int64_t n = vs::readBytesAt(AT_FDCWD, path.c_str(), 0, text, sizeof text - 1);
+    return n > 0 && text[0] == '1';
+}
+
+} // namespace
+
+VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneName> &zoneNames,
+                                                 std::span<const VSKernelZoneInfo> &zoneInfos,
+                                                 std::span<const VSKernelSiteInfo> &siteInfos) {
+    zoneNames = {};
+    zoneInfos = {};
+    siteInfos = {};
+    auto arrays = std::make_shared<KernelArrays>();
+    vs::ReadBuffer buffer;
+    std::string_view text;
+
+    // Zones. slabinfo is root-only; without it there is no kernel target.
+    int error = vs::readFileAt(AT_FDCWD, "/proc/slabinfo", buffer, text);
+    if (error != 0) {
+        return error;
+    }
+    for (const vs::SlabCache &cache : vs::parseSlabinfo(text)) {
+        VSKernelZoneName name;
+        std::memcpy(name.name, cache.name.data(), std::min(sizeof name.name, cache.name.size()));
+        VSKernelZoneInfo info;
+        info.elementsInUse = cache.activeObjects;
+        info.elementSize = cache.objectSize;
+        info.currentSize = cache.slabs * cache.pagesPerSlab * _pageSize;
+        info.collectable = slabReclaimable(cache.name) ? 1 : 0;
+        arrays->zoneNames.push_back(name);
+        arrays->zoneInfos.push_back(info);
+    }
+
+    // Sites by purpose, and the counters, from meminfo.
+    error = vs::readFileAt(AT_FDCWD, "/proc/meminfo", buffer, text);
+    if (error != 0) {
+        return error;
+    }
+    for (const MeminfoSite &site : kMeminfoSites) {
+        if (auto bytes = vs::statusBytes(text, site.name)) {
+            VSKernelSiteInfo info;
+            info.flags = vs::kSiteTypeTag | vs::kSiteFlagWired;
+            info.site = site.tag;
+            info.size = *bytes;
+            info.tag = static_cast<uint16_t>(site.tag);
+            arrays->siteInfos.push_back(info);
+        }
+    }
+    for (const MeminfoCounter &counter : kMeminfoCounters) {
+        if (auto bytes = vs::statusBytes(text, counter.name)) {
+            VSKernelSiteInfo info;
+            info.flags = vs::kSiteTypeCounter;
+            info.site = counter.index;
+            info.mapped = *bytes;
+            arrays->siteInfos.push_back(info);
+        }
+    }
+
+    // Modules, when the kernel has them.
+    if (vs::readFileAt(AT_FDCWD, "/proc/modules", buffer, text) == 0) {
+        uint64_t loadTag = 0;
+        for (const vs::KernelModule &module : vs::parseModules(text)) {
+            VSKernelSiteInfo info;
+            info.flags = vs::kSiteTypeKext | vs::kSiteFlagWired;
+            info.site = ++loadTag;
+            info.size = module.size;
+            arrays->siteInfos.push_back(info);
+        }
+    }
+
+    // vmalloc areas by calling code address.
+    if (vs::readFileAt(AT_FDCWD, "/proc/vmallocinfo", buffer, text) == 0) {
+        const auto callers = vs::parseVmallocinfo(text);
+        const auto symbols = loadKallsyms();
+        std::unordered_map<std::string_view, uint64_t> addressOf;
+        addressOf.reserve(symbols->size());
+        for (const vs::KernelSymbol &symbol : *symbols) {
+            addressOf.try_emplace(symbol.name, symbol.address);
+        }
+        uint64_t unresolved = 0;
+        for (const vs::VmallocCaller &caller : callers) {
+            VSKernelSiteInfo info;
+            info.flags = vs::kSiteTypeCodeAddress | vs::kSiteFlagWired;
+            info.size = caller.pages * _pageSize;
+            std::string_view symbol;
+            uint64_t offset = 0;
+            vs::splitCaller(caller.caller, symbol, offset);
+            auto it = addressOf.find(symbol);
+            if (it != addressOf.end()) {
+                info.site = it->second + offset;
+            } else {
+                // Name it as the kernel printed it.
+                info.site = kUnresolvedSiteBase + ++unresolved;
+                info.flags |= vs::kSiteFlagNamed;
+                setName(info.name, symbol);
+            }
+            arrays->siteInfos.push_back(info);
+        }
+    }
+
+    zoneNames = arrays->zoneNames;
+    zoneInfos = arrays->zoneInfos;
+    siteInfos = arrays->siteInfos;
+    std::lock_guard<std::mutex> lock(_kernelArraysMutex);
+    _kernelArrays.push_back(std::move(arrays));
+    return 0;
+}
+
+VSReturnCode VSLinuxPlatform::release_memory(const void *address, uint64_t length) {
+    std::lock_guard<std::mutex> lock(_kernelArraysMutex);
+    for (auto it = _kernelArrays.begin(); it != _kernelArrays.end(); ++it) {
+        KernelArrays &a = **it;
+        bool matched = false;
+        auto release = [&](const auto &vector, bool &held) {
+            using Element = typename std::decay_t<decltype(vector)>::value_type;
+            if (!matched && held && static_cast<const void *>(vector.data()) == address &&
+                length == vector.size() * sizeof(Element)) {
+                held = false;
+                matched = true;
+            }
+        };
+        release(a.zoneNames, a.zoneNamesHeld);
+        release(a.zoneInfos, a.zoneInfosHeld);
+        release(a.siteInfos, a.siteInfosHeld);
+        if (matched) {
+            if (!a.zoneNamesHeld && !a.zoneInfosHeld && !a.siteInfosHeld) {
+                _kernelArrays.erase(it);
+            }
+            return 0;
+        }
+    }
+    return EINVAL;
+}
+
+std::map<std::string, VSKextInfo> VSLinuxPlatform::loaded_kext_info() {
+    std::map<std::string, VSKextInfo> result;
+    std::string_view text;
+    if (vs::readFileAt(AT_FDCWD, "/proc/modules", text) != 0) {
+        return result;
+    }
+    // Load tags count modules in file order, as kernel_memory_info does.
+    uint64_t loadTag = 0;
+    for (const vs::KernelModule &module : vs::parseModules(text)) {
+        VSKextInfo info;
+        info.loadTag = ++loadTag;
+        info.bundleIdentifier = module.name;
+        info.loadAddress = module.address;
+        info.size = module.size;
+        result.emplace(module.name, std::move(info));
+    }
+    return result;
+}
+
+std::unique_ptr<VSKernelSymbolicator> VSLinuxPlatform::kernel_symbolicator() {
+    auto symbols = loadKallsyms();
+    if (symbols->empty()) {
+        return nullptr;
+    }
+    return std::make_unique<KallsymsSymbolicator>(std::move(symbols));
+}
+
+VSReturnCode VSLinuxPlatform::ports_lookup(std::vector<uint32_t> &ports) {
+    // A crash helper started through core_pattern's %F finds the crashing
+    // task's pidfd on fd 3. It becomes a task handle of this layer, which
+    // the region queries accept like any other.
+    ports.clear();
+    char link[64] = {};
+    if (::readlink("/proc/self/fd/3", link, sizeof link - 1) <= 0 ||
+        std::strstr(link, "pidfd") == nullptr) {
+        return 0;
+    }
+    std::string_view fdinfo;
+    if (vs::readFileAt(AT_FDCWD, "/proc/self/fdinfo/3", fdinfo) != 0) {
+        return 0;
+    }
+    const auto pidText = vs::statusValue(fdinfo, "Pid");
+    if (!pidText) {
+        return 0;
+    }
+    const int32_t pid = static_cast<int32_t>(std::strtol(std::string(*pidText).c_str(), nullptr, 10));
+    if (pid <= 0) {
+        return 0;
+    }
+    VSTaskHandle task = vs::kTaskHandleNone;
+    if (task_handle_for_pid(pid, task) != 0) {
+        return 0;
+    }
+    // The pid could have been reused before /proc/PID was opened; the pidfd
+    // still names the crashing task, so its pid must still read the same.
+    const std::string expected = std::to_string(pid);
+    if (vs::readFileAt(AT_FDCWD, "/proc/self/fdinfo/3", fdinfo) != 0 ||
+        vs::statusValue(fdinfo, "Pid").value_or("") != expected) {
+        release_task_handle(task);
+        return 0;
+    }
+    ports.push_back(task);
+    return 0;
+}

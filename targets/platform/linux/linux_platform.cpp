@@ -1,0 +1,884 @@
+#include "targets/platform/linux/linux_platform.h"
+
+#include "model/memory_region.h"
+#include "targets/platform/linux/elf_images.h"
+#include "targets/platform/linux/object_ids.h"
+#include "targets/platform/linux/proc_reader.h"
+#include "targets/platform/linux/proc_text.h"
+#include "targets/platform/linux/region_records.h"
+#include "targets/platform/linux/smaps_parser.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <climits>
+#include <cstdio>
+#include <cstring>
+#include <dirent.h>
+#include <elf.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+using vs::ReadBuffer;
+using vs::SmapsRegion;
+using vs::UniqueFd;
+
+struct VSLinuxPlatform::Task {
+    int32_t pid = 0;
+    UniqueFd dir;
+
+    std::mutex mutex; // guards everything below
+    bool parsed = false;
+    VSReturnCode parseCode = 0;
+    std::vector<SmapsRegion> regions;
+    std::vector<vs::MappingKind> kinds;
+    std::vector<VSRegionInfo> infos;
+};
+
+namespace {
+
+// Kernel stack of one thread (THREAD_SIZE) on the architectures we build for.
+constexpr uint64_t kKernelStackSize = 16 * 1024;
+
+constexpr uint64_t kProcessExitingFlag = 0x4; // PF_EXITING
+
+// Region queries keep 1 and 4 for their own meanings, so the two errnos with
+// those numbers are reported as their nearest neighbours.
+VSReturnCode regionErrno(int error) {
+    if (error == EPERM) {
+        return EACCES;
+    }
+    if (error == EINTR) {
+        return EIO;
+    }
+    return error;
+}
+
+void copyName(char *field, size_t fieldSize, std::string_view text) {
+    std::memset(field, 0, fieldSize);
+    std::memcpy(field, text.data(), std::min(fieldSize, text.size()));
+}
+
+bool hostIs64Bit() {
+    return sizeof(void *) == 8;
+}
+
+// True when the process behind `dirFd` has gone or is going: reaped, a
+// zombie, dead, or past the point where its address space was torn down.
+bool processHasGone(int dirFd) {
+    char buffer[1024];
+    const int64_t n = vs::readBytesAt(dirFd, "stat", 0, buffer, sizeof buffer - 1);
+    if (n <= 0) {
+        return n == -ESRCH || n == -ENOENT || n == 0;
+    }
+    const auto st = vs::parseStat(std::string_view(buffer, static_cast<size_t>(n)));
+    if (!st) {
+        return false;
+    }
+    return st->state == 'Z' || st->state == 'X' || (st->flags & kProcessExitingFlag) != 0;
+}
+
+std::vector<uint64_t> threadStackPointers(int dirFd) {
+    std::vector<uint64_t> pointers;
+    const int taskFd = ::openat(dirFd, "task", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (taskFd < 0) {
+        return pointers;
+    }
+    DIR *dir = ::fdopendir(taskFd);
+    if (dir == nullptr) {
+        ::close(taskFd);
+        return pointers;
+    }
+    while (const dirent *entry = ::readdir(dir)) {
+        if (entry->d_name[0] < '0' || entry->d_name[0] > '9') {
+            continue;
+        }
+        char name[sizeof entry->d_name + 16];
+        std::snprintf(name, sizeof name, "%s/syscall", entry->d_name);
+        char text[256];
+        const int64_t n = vs::readBytesAt(taskFd, name, 0, text, sizeof text);
+        if (n <= 0) {
+            continue;
+        }
+        if (auto sp = vs::parseSyscallStackPointer(std::string_view(text, static_cast<size_t>(n)))) {
+            pointers.push_back(*sp);
+        }
+    }
+    ::closedir(dir); // closes taskFd
+    std::sort(pointers.begin(), pointers.end());
+    return pointers;
+}
+
+struct MappedFileContext {
+    int dirFd;
+};
+
+// Reads a file the process maps: through map_files/ (which also reaches
+// deleted files) and, when that is refused, through the process's root.
+int64_t readMappedFile(void *context, const SmapsRegion &region, uint64_t offset, void *out,
+                       size_t size) {
+    const int dirFd = static_cast<MappedFileContext *>(context)->dirFd;
+    char name[64];
+    std::snprintf(name, sizeof name, "map_files/%llx-%llx",
+                  static_cast<unsigned long long>(region.start),
+                  static_cast<unsigned long long>(region.end));
+    int64_t n = vs::readBytesAt(dirFd, name, offset, out, size);
+    if (n >= 0) {
+        return n;
+    }
+    std::string rooted = "root" + region.path;
+    n = vs::readBytesAt(dirFd, rooted.c_str(), offset, out, size);
+    if (n < 0) {
+        return n;
+    }
+    // The path may name another file by now; only the mapped inode counts.
+    struct stat st {};
+    if (::fstatat(dirFd, rooted.c_str(), &st, 0) != 0 || st.st_ino != region.inode) {
+        return -ENOENT;
+    }
+    return n;
+}
+
+// Index of the first region ending above `address`, or regions.size().
+size_t regionAtOrAbove(const std::vector<SmapsRegion> &regions, uint64_t address) {
+    auto it = std::upper_bound(regions.begin(), regions.end(), address,
+                               [](uint64_t a, const SmapsRegion &r) { return a < r.end; });
+    return static_cast<size_t>(it - regions.begin());
+}
+
+int openProc(int32_t pid, int flags) {
+    char path[64];
+    std::snprintf(path, sizeof path, "%s/%d", VSLinuxPlatform::kProcRoot, pid);
+    return ::open(path, flags | O_CLOEXEC);
+}
+
+// Reads /proc/PID/<name> into the thread's buffer. 0 or the errno.
+int readPidFile(int32_t pid, const char *name, std::string_view &text) {
+    char path[96];
+    std::snprintf(path, sizeof path, "%s/%d/%s", VSLinuxPlatform::kProcRoot, pid, name);
+    return vs::readFileAt(AT_FDCWD, path, text);
+}
+
+} // namespace
+
+VSLinuxPlatform::VSLinuxPlatform() : _pageSize(static_cast<uint64_t>(::sysconf(_SC_PAGESIZE))) {}
+
+VSLinuxPlatform::~VSLinuxPlatform() {
+    if (_kpageflagsFd >= 0) {
+        ::close(_kpageflagsFd);
+    }
+}
+
+// ---- processes ---------------------------------------------------------------------
+
+int32_t VSLinuxPlatform::list_all_pids(std::span<int32_t> buffer) {
+    DIR *dir = ::opendir(kProcRoot);
+    if (dir == nullptr) {
+        return -1;
+    }
+    std::vector<int32_t> pids;
+    pids.push_back(0); // the kernel stands for all kernel threads
+    const bool counting = buffer.empty();
+    while (const dirent *entry = ::readdir(dir)) {
+        const char *name = entry->d_name;
+        if (name[0] < '1' || name[0] > '9') {
+            continue;
+        }
+        char *end = nullptr;
+        const long pid = std::strtol(name, &end, 10);
+        if (*end != '\0' || pid <= 0 || pid > INT32_MAX) {
+            continue;
+        }
+        if (!counting) {
+            std::string_view text;
+            if (readPidFile(static_cast<int32_t>(pid), "stat", text) != 0) {
+                continue; // exited meanwhile
+            }
+            const auto st = vs::parseStat(text);
+            if (!st || (st->flags & vs::kLinuxKernelThreadFlag) != 0) {
+                continue;
+            }
+        }
+        pids.push_back(static_cast<int32_t>(pid));
+    }
+    ::closedir(dir);
+    if (counting) {
+        return static_cast<int32_t>(pids.size());
+    }
+    std::sort(pids.begin(), pids.end());
+    const size_t stored = std::min(pids.size(), buffer.size());
+    std::copy_n(pids.begin(), stored, buffer.begin());
+    return static_cast<int32_t>(stored);
+}
+
+int32_t VSLinuxPlatform::pid_bsd_info(int32_t pid, VSBsdInfo &info) {
+    info = VSBsdInfo{};
+    if (pid == 0) {
+        info.flags = vs::kBsdInfoFlagSystem | (hostIs64Bit() ? vs::kBsdInfoFlag64Bit : 0);
+        copyName(info.commandName, sizeof info.commandName, "kernel");
+        copyName(info.name, sizeof info.name, "kernel");
+        return sizeof(VSBsdInfo);
+    }
+    if (pid < 0) {
+        return 0;
+    }
+    const int dirFd = openProc(pid, O_RDONLY | O_DIRECTORY);
+    if (dirFd < 0) {
+        return 0;
+    }
+    UniqueFd dir(dirFd);
+    std::string_view text;
+    if (vs::readFileAt(dir.get(), "stat", text) != 0) {
+        return 0;
+    }
+    const auto st = vs::parseStat(text);
+    if (!st) {
+        return 0;
+    }
+    info.pid = static_cast<uint32_t>(pid);
+    info.ppid = static_cast<uint32_t>(st->ppid);
+    copyName(info.commandName, sizeof info.commandName, st->comm);
+    copyName(info.name, sizeof info.name, st->comm);
+
+    bool is64 = hostIs64Bit();
+    unsigned char ident[EI_NIDENT] = {};
+    if (vs::readBytesAt(dir.get(), "exe", 0, ident, EI_CLASS + 1) == EI_CLASS + 1 &&
+        std::memcmp(ident, ELFMAG, SELFMAG) == 0) {
+        is64 = ident[EI_CLASS] == ELFCLASS64;
+    }
+    if (is64) {
+        info.flags |= vs::kBsdInfoFlag64Bit;
+    }
+    return sizeof(VSBsdInfo);
+}
+
+int32_t VSLinuxPlatform::pid_short_info(int32_t pid, VSShortInfo &info, int32_t &errorNumber) {
+    info = VSShortInfo{};
+    errorNumber = 0;
+    std::string_view text;
+    const int error = pid > 0 ? readPidFile(pid, "stat", text) : ESRCH;
+    if (error != 0) {
+        errorNumber = (error == ENOENT || error == ESRCH) ? vs::kErrorNoSuchProcess : error;
+        return 0;
+    }
+    const auto st = vs::parseStat(text);
+    if (!st) {
+        errorNumber = vs::kErrorNoSuchProcess;
+        return 0;
+    }
+    switch (st->state) {
+    case 'Z':
+    case 'X':
+        info.runStatus = vs::kRunStatusZombie;
+        break;
+    case 'T':
+    case 't':
+        info.runStatus = 4; // stopped
+        break;
+    case 'R':
+        info.runStatus = 2; // runnable
+        break;
+    default:
+        info.runStatus = 3; // sleeping
+        break;
+    }
+    return sizeof(VSShortInfo);
+}
+
+int32_t VSLinuxPlatform::pid_dirty_flags(int32_t, uint32_t &flags) {
+    // No idle-exit tracking on Linux: every process is "unsupported".
+    flags = 0;
+    return 0;
+}
+
+int32_t VSLinuxPlatform::pid_resource_usage(int32_t pid, int32_t version,
+                                            VSResourceUsageInfo &info) {
+    info = VSResourceUsageInfo{};
+    if (version != vs::kResourceUsageVersion4 || pid <= 0) {
+        return EINVAL;
+    }
+    std::string_view status;
+    const int error = readPidFile(pid, "status", status);
+    if (error != 0) {
+        return error == ENOENT ? ESRCH : error;
+    }
+    const auto anon = vs::statusBytes(status, "RssAnon");
+    const auto shmem = vs::statusBytes(status, "RssShmem");
+    const auto swap = vs::statusBytes(status, "VmSwap");
+    const auto pte = vs::statusBytes(status, "VmPTE");
+    const auto peak = vs::statusBytes(status, "VmHWM");
+    if (!anon || !shmem || !swap || !pte || !peak) {
+        return ESRCH; // a zombie has no memory lines
+    }
+    // Swapped shmem pages are not in the page tables, so VmSwap misses
+    // them; smaps has them per mapping. Only worth a read when swap exists.
+    uint64_t shmemSwap = 0;
+    std::call_once(_swapOnce, [this] {
+        std::string_view meminfo;
+        if (vs::readFileAt(AT_FDCWD, "/proc/meminfo", meminfo) == 0) {
+            _swapConfigured = vs::statusBytes(meminfo, "SwapTotal").value_or(0) > 0;
+        }
+    });
+    if (_swapConfigured) {
+        std::string_view smaps;
+        if (readPidFile(pid, "smaps", smaps) == 0) {
+            std::vector<SmapsRegion> regions;
+            vs::parseSmaps(smaps, regions);
+            for (const SmapsRegion &r : regions) {
+                if (vs::mappingKind(r, _tmpfsDevices()) == vs::MappingKind::SharedMemory) {
+                    shmemSwap += r.swap;
+                }
+            }
+        }
+    }
+    info.physVestage = *anon + *shmem + *swap + shmemSwap + *pte;
+    info.lifetimeMaxPhysVestage = *peak;
+    return 0;
+}
+
+int32_t VSLinuxPlatform::pid_region_filename(int32_t pid, uint64_t address,
+                                             std::span<char> buffer) {
+    std::string path;
+    bool found = false;
+    std::vector<std::shared_ptr<Task>> candidates;
+    {
+        std::lock_guard<std::mutex> lock(_tasksMutex);
+        for (auto &[handle, task] : _tasks) {
+            if (task->pid == pid) {
+                candidates.push_back(task);
+            }
+        }
+    }
+    for (auto &task : candidates) {
+        std::lock_guard<std::mutex> lock(task->mutex);
+        if (!task->parsed || task->parseCode != 0) {
+            continue;
+        }
+        const size_t i = regionAtOrAbove(task->regions, address);
+        if (i < task->regions.size() && task->regions[i].start <= address) {
+            path = task->regions[i].path;
+            found = true;
+        }
+        break;
+    }
+    if (!found) {
+        std::string_view maps;
+        if (pid <= 0 || readPidFile(pid, "maps", maps) != 0) {
+            return 0;
+        }
+        std::vector<SmapsRegion> regions;
+        vs::parseSmaps(maps, regions);
+        const size_t i = regionAtOrAbove(regions, address);
+        if (i >= regions.size() || regions[i].start > address) {
+            return 0;
+        }
+        path = regions[i].path;
+    }
+    if (path.empty() || path[0] == '[') {
+        return 0; // anonymous memory and the kernel's pseudo mappings
+    }
+    const size_t length = std::min(path.size(), buffer.size());
+    std::memcpy(buffer.data(), path.data(), length);
+    return static_cast<int32_t>(length);
+}
+
+int32_t VSLinuxPlatform::argument_area_max_size(int32_t &size) {
+    // The arguments and environment share ARG_MAX; the area adds the
+    // executable path and the count in front.
+    long argMax = ::sysconf(_SC_ARG_MAX);
+    if (argMax <= 0 || argMax > 16 * 1024 * 1024) {
+        argMax = 2 * 1024 * 1024;
+    }
+    size = static_cast<int32_t>(argMax + PATH_MAX + 16);
+    return 0;
+}
+
+int32_t VSLinuxPlatform::process_argument_area(int32_t pid, std::span<char> buffer,
+                                               size_t &length) {
+    length = 0;
+    if (pid <= 0) {
+        return ESRCH;
+    }
+    const int dirFd = openProc(pid, O_RDONLY | O_DIRECTORY);
+    if (dirFd < 0) {
+        return errno == ENOENT ? ESRCH : errno;
+    }
+    UniqueFd dir(dirFd);
+    char exe[PATH_MAX + 1];
+    const ssize_t exeLength = ::readlinkat(dir.get(), "exe", exe, PATH_MAX);
+    if (exeLength <= 0) {
+        return exeLength == 0 ? ENOENT : errno;
+    }
+    std::string_view exePath(exe, static_cast<size_t>(exeLength));
+    constexpr std::string_view kDeleted = " (deleted)";
+    if (exePath.size() > kDeleted.size() && exePath.ends_with(kDeleted)) {
+        exePath.remove_suffix(kDeleted.size()); // the name is what matters
+    }
+    std::string_view cmdline;
+    if (vs::readFileAt(dir.get(), "cmdline", cmdline) != 0) {
+        cmdline = {};
+    }
+
+    // count, executable path, zero padding to the pointer size, arguments
+    std::string area(sizeof(uint32_t), '\0');
+    const uint32_t argc = vs::countArguments(cmdline);
+    std::memcpy(area.data(), &argc, sizeof argc);
+    area.append(exePath);
+    area.push_back('\0');
+    while (area.size() % sizeof(void *) != 0) {
+        area.push_back('\0');
+    }
+    area.append(cmdline);
+    length = std::min(area.size(), buffer.size());
+    std::memcpy(buffer.data(), area.data(), length);
+    return 0;
+}
+
+uint64_t VSLinuxPlatform::target_platform_code(int32_t, bool) {
+    return VSPlatformNone;
+}
+
+// ---- tasks -------------------------------------------------------------------------------
+
+std::shared_ptr<VSLinuxPlatform::Task> VSLinuxPlatform::_task(VSTaskHandle handle) {
+    std::lock_guard<std::mutex> lock(_tasksMutex);
+    auto it = _tasks.find(handle);
+    return it == _tasks.end() ? nullptr : it->second;
+}
+
+VSTaskHandle VSLinuxPlatform::_registerTask(std::shared_ptr<Task> task) {
+    std::lock_guard<std::mutex> lock(_tasksMutex);
+    do {
+        ++_lastHandle;
+    } while (_lastHandle == vs::kTaskHandleNone || _lastHandle == vs::kPortDead ||
+             _tasks.count(_lastHandle) != 0);
+    _tasks.emplace(_lastHandle, std::move(task));
+    return _lastHandle;
+}
+
+VSReturnCode VSLinuxPlatform::task_handle_for_pid(int32_t pid, VSTaskHandle &task) {
+    task = vs::kTaskHandleNone;
+    if (pid <= 0) {
+        return ESRCH;
+    }
+    const int dirFd = openProc(pid, O_RDONLY | O_DIRECTORY);
+    if (dirFd < 0) {
+        return errno == ENOENT ? ESRCH : errno;
+    }
+    auto entry = std::make_shared<Task>();
+    entry->pid = pid;
+    entry->dir = UniqueFd(dirFd);
+    // Whether the process may be read at all shows when its maps open.
+    const int mapsFd = ::openat(dirFd, "maps", O_RDONLY | O_CLOEXEC);
+    if (mapsFd < 0) {
+        return errno;
+    }
+    ::close(mapsFd);
+    task = _registerTask(std::move(entry));
+    return 0;
+}
+
+VSReturnCode VSLinuxPlatform::release_task_handle(VSTaskHandle task) {
+    std::lock_guard<std::mutex> lock(_tasksMutex);
+    return _tasks.erase(task) == 1 ? 0 : EBADF;
+}
+
+const std::vector<uint64_t> &VSLinuxPlatform::_tmpfsDevices() {
+    std::call_once(_tmpfsOnce, [this] {
+        std::string_view mountinfo;
+        if (vs::readFileAt(AT_FDCWD, "/proc/self/mountinfo", mountinfo) == 0) {
+            _tmpfs = vs::parseTmpfsDevices(mountinfo);
+        }
+    });
+    return _tmpfs;
+}
+
+VSReturnCode VSLinuxPlatform::_parse(Task &task) {
+    ReadBuffer &buffer = vs::threadReadBuffer();
+    std::string_view text;
+    const int error = vs::readFileAt(task.dir.get(), "smaps", buffer, text);
+    if (error != 0) {
+        return (error == ESRCH || error == ENOENT) ? vs::kReturnDeadPort : regionErrno(error);
+    }
+    vs::parseSmaps(text, task.regions);
+    if (task.regions.empty() && processHasGone(task.dir.get())) {
+        return vs::kReturnDeadPort;
+    }
+    const std::vector<uint64_t> stackPointers = threadStackPointers(task.dir.get());
+    const std::vector<uint64_t> &tmpfs = _tmpfsDevices();
+    vs::ObjectIdTable &ids = vs::ObjectIdTable::shared();
+    task.kinds.reserve(task.regions.size());
+    task.infos.reserve(task.regions.size());
+    for (const SmapsRegion &region : task.regions) {
+        const vs::MappingKind kind = vs::mappingKind(region, tmpfs);
+        const uint32_t tag = vs::userTagFor(region, kind, stackPointers);
+        const uint32_t objectId = vs::objectIdFor(region, kind, ids);
+        task.kinds.push_back(kind);
+        task.infos.push_back(vs::regionInfoFor(region, kind, tag, objectId, _pageSize));
+    }
+    return 0;
+}
+
+VSReturnCode VSLinuxPlatform::_ensureParsed(Task &task) {
+    if (!task.parsed) {
+        task.parseCode = _parse(task);
+        task.parsed = true;
+    }
+    return task.parseCode;
+}
+
+VSReturnCode VSLinuxPlatform::region_recurse(VSTaskHandle handle, uint64_t &address,
+                                             uint64_t &size, uint32_t &depth,
+                                             VSRegionInfo &info, uint32_t &infoCount) {
+    auto task = _task(handle);
+    if (!task) {
+        return vs::kReturnDeadPort;
+    }
+    if (infoCount < vs::kRegionInfoCount) {
+        return EINVAL;
+    }
+    std::lock_guard<std::mutex> lock(task->mutex);
+    const VSReturnCode code = _ensureParsed(*task);
+    if (code != 0) {
+        return code;
+    }
+    const size_t i = regionAtOrAbove(task->regions, address);
+    if (i >= task->regions.size()) {
+        return vs::kReturnNoMoreRegions;
+    }
+    address = task->regions[i].start;
+    size = task->regions[i].size();
+    depth = 0;
+    info = task->infos[i];
+    infoCount = vs::kRegionInfoCount;
+    return 0;
+}
+
+VSReturnCode VSLinuxPlatform::region_info(VSTaskHandle handle, uint64_t &address, uint64_t &size,
+                                          int32_t flavor, VSRegionBasicInfo &info,
+                                          uint32_t &infoCount, uint32_t &objectName) {
+    objectName = 0;
+    auto task = _task(handle);
+    if (!task) {
+        return vs::kReturnDeadPort;
+    }
+    if (flavor != vs::kRegionBasicInfoFlavor || infoCount < vs::kRegionBasicInfoCount) {
+        return EINVAL;
+    }
+    std::lock_guard<std::mutex> lock(task->mutex);
+    const VSReturnCode code = _ensureParsed(*task);
+    if (code != 0) {
+        return code;
+    }
+    const size_t i = regionAtOrAbove(task->regions, address);
+    if (i >= task->regions.size()) {
+        return vs::kReturnNoMoreRegions;
+    }
+    address = task->regions[i].start;
+    size = task->regions[i].size();
+    info = vs::basicInfoFor(task->regions[i], task->kinds[i], _pageSize);
+    infoCount = vs::kRegionBasicInfoCount;
+    return 0;
+}
+
+VSReturnCode VSLinuxPlatform::page_range_query(VSTaskHandle handle, uint64_t address,
+                                               uint64_t length, std::span<int32_t> dispositions,
+                                               uint64_t &count) {
+    count = 0;
+    auto task = _task(handle);
+    if (!task) {
+        return vs::kReturnInvalidArgument;
+    }
+    const uint64_t first = address & ~(_pageSize - 1);
+    const uint64_t last = (address + length + _pageSize - 1) & ~(_pageSize - 1);
+    const uint64_t pages = std::min<uint64_t>((last - first) / _pageSize, dispositions.size());
+    if (pages == 0) {
+        return 0;
+    }
+
+    // Which pages belong to file mappings decides "external": a present
+    // page of the shmem family is as undroppable as anonymous memory.
+    std::vector<std::pair<uint64_t, uint64_t>> fileRanges;
+    bool haveRegions = false;
+    {
+        std::lock_guard<std::mutex> lock(task->mutex);
+        if (_ensureParsed(*task) == 0) {
+            haveRegions = true;
+            for (size_t i = 0; i < task->regions.size(); ++i) {
+                if (task->kinds[i] == vs::MappingKind::File) {
+                    fileRanges.emplace_back(task->regions[i].start, task->regions[i].end);
+                }
+            }
+        }
+    }
+    const int pagemap = ::openat(task->dir.get(), "pagemap", O_RDONLY | O_CLOEXEC);
+    if (pagemap < 0) {
+        return (errno == ESRCH || errno == ENOENT) ? vs::kReturnInvalidArgument : errno;
+    }
+    UniqueFd pagemapFd(pagemap);
+
+    std::call_once(_kpageflagsOnce, [this] {
+        _kpageflagsFd = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC);
+    });
+
+    constexpr uint64_t kPresent = 1ull << 63;
+    constexpr uint64_t kSwapped = 1ull << 62;
+    constexpr uint64_t kFileOrSharedAnon = 1ull << 61;
+    constexpr uint64_t kGuard = 1ull << 58;
+    constexpr uint64_t kPfnMask = (1ull << 55) - 1;
+    constexpr uint64_t kDirtyPageFlag = 1ull << 4; // KPF_DIRTY
+    constexpr uint64_t kBatch = 4096;
+
+    std::vector<uint64_t> entries(std::min(pages, kBatch));
+    std::vector<std::pair<uint64_t, uint64_t>> presentPfns; // (pfn, page index)
+    for (uint64_t done = 0; done < pages;) {
+        const uint64_t batch = std::min(pages - done, kBatch);
+        const off_t offset = static_cast<off_t>((first / _pageSize + done) * sizeof(uint64_t));
+        const ssize_t n = ::pread(pagemapFd.get(), entries.data(), batch * sizeof(uint64_t), offset);
+        if (n < 0) {
+            return (errno == ESRCH || errno == ENOENT) ? vs::kReturnInvalidArgument : errno;
+        }
+        if (n == 0) {
+            // No address space any more: the process is exiting.
+            return vs::kReturnInvalidArgument;
+        }
+        const uint64_t got = static_cast<uint64_t>(n) / sizeof(uint64_t);
+        size_t fileIndex = 0;
+        for (uint64_t k = 0; k < got; ++k) {
+            const uint64_t index = done + k;
+            const uint64_t entry = entries[k];
+            const uint64_t page = first + index * _pageSize;
+            int32_t word = 0;
+            if ((entry & kGuard) != 0) {
+                dispositions[index] = 0; // a guard marker holds no page
+                continue;
+            }
+            if ((entry & kPresent) != 0) {
+                word |= vs::kPageDispositionPresent;
+                if ((entry & kPfnMask) != 0) {
+                    presentPfns.emplace_back(entry & kPfnMask, index);
+                }
+            } else if ((entry & kSwapped) != 0) {
+                word |= vs::kPageDispositionPagedOut;
+            }
+            if ((entry & kFileOrSharedAnon) != 0) {
+                bool external = !haveRegions;
+                while (fileIndex < fileRanges.size() && fileRanges[fileIndex].second <= page) {
+                    ++fileIndex;
+                }
+                if (fileIndex < fileRanges.size() && fileRanges[fileIndex].first <= page) {
+                    external = true;
+                }
+                if (external) {
+                    word |= vs::kPageDispositionExternal;
+                }
+            }
+            dispositions[index] = word;
+        }
+        done += got;
+        if (got < batch) {
+            // Past the end of the user address space: nothing is mapped.
+            for (uint64_t index = done; index < pages; ++index) {
+                dispositions[index] = 0;
+            }
+            break;
+        }
+    }
+
+    // Dirty bits come from the page frames, read in runs of nearby frames.
+    if (_kpageflagsFd >= 0 && !presentPfns.empty()) {
+        std::sort(presentPfns.begin(), presentPfns.end());
+        constexpr uint64_t kMaxRun = 512;
+        std::vector<uint64_t> flags(kMaxRun);
+        size_t i = 0;
+        while (i < presentPfns.size()) {
+            const uint64_t runStart = presentPfns[i].first;
+            size_t j = i;
+            while (j + 1 < presentPfns.size() && presentPfns[j + 1].first - runStart < kMaxRun) {
+                ++j;
+            }
+            const uint64_t runLength = presentPfns[j].first - runStart + 1;
+            const ssize_t n = ::pread(_kpageflagsFd, flags.data(), runLength * sizeof(uint64_t),
+                                      static_cast<off_t>(runStart * sizeof(uint64_t)));
+            if (n > 0) {
+                const uint64_t got = static_cast<uint64_t>(n) / sizeof(uint64_t);
+                for (size_t k = i; k <= j; ++k) {
+                    const uint64_t at = presentPfns[k].first - runStart;
+                    if (at < got && (flags[at] & kDirtyPageFlag) != 0) {
+                        dispositions[presentPfns[k].second] |= vs::kPageDispositionDirty;
+                    }
+                }
+            }
+            i = j + 1;
+        }
+    }
+    count = pages;
+    return 0;
+}
+
+VSReturnCode VSLinuxPlatform::purgeable_control(VSTaskHandle, uint64_t, int32_t, int32_t &state) {
+    // There is no purgeable memory on Linux.
+    state = VSPurgeableDeny;
+    return ENOTSUP;
+}
+
+VSReturnCode VSLinuxPlatform::task_memory_info(VSTaskHandle handle, VSTaskKernelMemoryInfo &info,
+                                               uint32_t &count) {
+    info = VSTaskKernelMemoryInfo{};
+    auto task = _task(handle);
+    if (!task) {
+        return vs::kReturnDeadPort;
+    }
+    if (count < vs::kTaskKernelMemoryInfoCount) {
+        return EINVAL;
+    }
+    std::string_view status;
+    const int error = vs::readFileAt(task->dir.get(), "status", status);
+    if (error != 0) {
+        return (error == ESRCH || error == ENOENT) ? vs::kReturnDeadPort : error;
+    }
+    const auto pte = vs::statusBytes(status, "VmPTE");
+    const auto threads = vs::statusBytes(status, "Threads");
+    if (!pte || !threads) {
+        return vs::kReturnDeadPort;
+    }
+    // Page tables and the kernel stacks of the threads are the memory the
+    // kernel keeps for this process alone.
+    info.privateAllocated = *pte + *threads * kKernelStackSize;
+    count = vs::kTaskKernelMemoryInfoCount;
+    return 0;
+}
+
+std::vector<VSSymbolicatorImage> VSLinuxPlatform::symbolicator(VSTaskHandle handle, uint32_t) {
+    std::vector<VSSymbolicatorImage> result;
+    auto task = _task(handle);
+    if (!task) {
+        return result;
+    }
+    std::lock_guard<std::mutex> lock(task->mutex);
+    if (_ensureParsed(*task) != 0) {
+        return result;
+    }
+    MappedFileContext context{task->dir.get()};
+    const auto images = vs::processImages(task->regions, _pageSize, vs::ElfCache::shared(),
+                                          readMappedFile, &context);
+    result.reserve(images.size());
+    for (const vs::ProcessImage &image : images) {
+        VSSymbolicatorImage out;
+        out.path = image.path;
+        for (const vs::ImageSegment &segment : image.segments) {
+            out.segments.push_back(VSSymbolicatorSegment{segment.name, segment.start, segment.size});
+        }
+        result.push_back(std::move(out));
+    }
+    return result;
+}
+
+VSReturnCode VSLinuxPlatform::task_regions(VSTaskHandle handle, std::vector<SmapsRegion> &regions) {
+    regions.clear();
+    auto task = _task(handle);
+    if (!task) {
+        return vs::kReturnDeadPort;
+    }
+    std::lock_guard<std::mutex> lock(task->mutex);
+    const VSReturnCode code = _ensureParsed(*task);
+    if (code == 0) {
+        regions = task->regions;
+    }
+    return code;
+}
+
+int32_t VSLinuxPlatform::task_pid(VSTaskHandle handle) {
+    auto task = _task(handle);
+    return task ? task->pid : -1;
+}
+
+// ---- codes and system facts ------------------------------------------------------------
+
+uint64_t VSLinuxPlatform::kernel_page_size() {
+    return _pageSize;
+}
+
+std::string VSLinuxPlatform::error_text(VSReturnCode code) {
+    switch (code) {
+    case vs::kReturnSuccess:
+        return "success";
+    case vs::kReturnNoMoreRegions:
+        return "no region at or above the address";
+    case vs::kReturnInvalidArgument:
+        return "invalid argument";
+    case vs::kReturnDeadPort:
+        return "the process has gone away";
+    default:
+        break;
+    }
+    if (code > 0) {
+        char buffer[256];
+        // The GNU strerror_r returns the text, which may not be the buffer.
+        const char *text = ::strerror_r(code, buffer, sizeof buffer);
+        return text;
+    }
+    return "error " + std::to_string(code);
+}
+
+void VSLinuxPlatform::report_error_code(std::string_view label, VSReturnCode code) {
+    const std::string text = error_text(code);
+    std::fprintf(stderr, "%.*s: %s (%d)\n", static_cast<int>(label.size()), label.data(),
+                 text.c_str(), code);
+}
+
+std::optional<std::string> VSLinuxPlatform::dynamic_tag_name(uint32_t tag) {
+    if (auto name = vs::dynamicTagName(tag)) {
+        return name;
+    }
+    if (const char *fixed = vs::userTagTableName(tag)) {
+        return std::string(fixed);
+    }
+    return std::nullopt;
+}
+
+// ---- this program's own task ---------------------------------------------------------------
+
+int32_t VSLinuxPlatform::sysctl_by_name_read(std::string_view name, int32_t &value) {
+    std::string path = "/proc/sys/";
+    for (char c : name) {
+        path.push_back(c == '.' ? '/' : c);
+    }
+    std::string_view text;
+    const int error = vs::readFileAt(AT_FDCWD, path.c_str(), text);
+    if (error != 0) {
+        return error;
+    }
+    char *end = nullptr;
+    const std::string copy(text);
+    const long parsed = std::strtol(copy.c_str(), &end, 10);
+    if (end == copy.c_str()) {
+        return EINVAL;
+    }
+    value = static_cast<int32_t>(parsed);
+    return 0;
+}
+
+int32_t VSLinuxPlatform::sysctl_by_name_write(std::string_view name, int32_t value) {
+    std::string path = "/proc/sys/";
+    for (char c : name) {
+        path.push_back(c == '.' ? '/' : c);
+    }
+    const int fd = ::open(path.c_str(), O_WRONLY | O_CLOEXEC);
+    if (fd < 0) {
+        return errno;
+    }
+    const std::string text = std::to_string(value) + "\n";
+    const ssize_t n = ::write(fd, text.data(), text.size());
+    const int error = n < 0 ? errno : 0;
+    ::close(fd);
+    return error;
+}
+
+int32_t VSLinuxPlatform::own_pid() {
+    return static_cast<int32_t>(::getpid());
+}
+
+uint32_t VSLinuxPlatform::effective_user_id() {
+    return static_cast<uint32_t>(::geteuid());
+}

@@ -1,0 +1,123 @@
+#pragma once
+
+// The query layer on Linux, answered from procfs and sysfs.
+//
+// A task handle is a small integer naming an entry of a table; the entry
+// holds an open /proc/PID directory fd and every later read goes through
+// openat() on it. Once the process is reaped those opens fail with ESRCH,
+// so a handle never reads a process that reused the pid.
+//
+// The region queries answer from one parse of /proc/PID/smaps per handle,
+// made on first use and kept on the handle: the images (symbolicator) and
+// the walk (region_recurse, region_info) then see the same address space.
+// Linux has no submaps and no shared cache region.
+//
+// Codes: 0 success; 1 past the last region; 4 for page queries of a
+// process that has gone; 0x10000003 when a region query finds the process
+// gone (reaped, or a zombie whose smaps reads empty); otherwise the errno.
+
+#include "targets/platform/platform.h"
+
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+namespace vs {
+struct SmapsRegion;
+class ObjectIdTable;
+class ElfCache;
+} // namespace vs
+
+class VSLinuxPlatform : public VSPlatform {
+public:
+    VSLinuxPlatform();
+    ~VSLinuxPlatform() override;
+
+    int32_t list_all_pids(std::span<int32_t> buffer) override;
+    int32_t pid_bsd_info(int32_t pid, VSBsdInfo &info) override;
+    int32_t pid_short_info(int32_t pid, VSShortInfo &info, int32_t &errorNumber) override;
+    int32_t pid_dirty_flags(int32_t pid, uint32_t &flags) override;
+    int32_t pid_resource_usage(int32_t pid, int32_t version, VSResourceUsageInfo &info) override;
+    int32_t pid_region_filename(int32_t pid, uint64_t address, std::span<char> buffer) override;
+    int32_t argument_area_max_size(int32_t &size) override;
+    int32_t process_argument_area(int32_t pid, std::span<char> buffer, size_t &length) override;
+    uint64_t target_platform_code(int32_t pid, bool is64bit) override;
+
+    VSReturnCode task_handle_for_pid(int32_t pid, VSTaskHandle &task) override;
+    VSReturnCode release_task_handle(VSTaskHandle task) override;
+    VSReturnCode region_recurse(VSTaskHandle task, uint64_t &address, uint64_t &size,
+                                uint32_t &depth, VSRegionInfo &info,
+                                uint32_t &infoCount) override;
+    VSReturnCode region_info(VSTaskHandle task, uint64_t &address, uint64_t &size, int32_t flavor,
+                             VSRegionBasicInfo &info, uint32_t &infoCount,
+                             uint32_t &objectName) override;
+    VSReturnCode page_range_query(VSTaskHandle task, uint64_t address, uint64_t length,
+                                  std::span<int32_t> dispositions, uint64_t &count) override;
+    VSReturnCode purgeable_control(VSTaskHandle task, uint64_t address, int32_t operation,
+                                   int32_t &state) override;
+    VSReturnCode task_memory_info(VSTaskHandle task, VSTaskKernelMemoryInfo &info,
+                                  uint32_t &count) override;
+    std::vector<VSSymbolicatorImage> symbolicator(VSTaskHandle task, uint32_t flags) override;
+
+    uint64_t kernel_page_size() override;
+    std::string error_text(VSReturnCode code) override;
+    void report_error_code(std::string_view label, VSReturnCode code) override;
+    std::optional<std::string> dynamic_tag_name(uint32_t tag) override;
+
+    VSReturnCode kernel_memory_info(std::span<const VSKernelZoneName> &zoneNames,
+                                    std::span<const VSKernelZoneInfo> &zoneInfos,
+                                    std::span<const VSKernelSiteInfo> &siteInfos) override;
+    VSReturnCode release_memory(const void *address, uint64_t length) override;
+    std::map<std::string, VSKextInfo> loaded_kext_info() override;
+    std::unique_ptr<VSKernelSymbolicator> kernel_symbolicator() override;
+
+    VSReturnCode ports_lookup(std::vector<uint32_t> &ports) override;
+    int32_t sysctl_by_name_read(std::string_view name, int32_t &value) override;
+    int32_t sysctl_by_name_write(std::string_view name, int32_t value) override;
+    int32_t own_pid() override;
+    uint32_t effective_user_id() override;
+
+    // Where the layer finds procfs; tests point it at nothing else, but
+    // keeping the root in one place keeps every path relative to it.
+    static constexpr const char *kProcRoot = "/proc";
+
+    // The regions of a task as parsed from smaps, for tests and tools that
+    // want the Linux view (path, device, inode) beside the records.
+    // Returns the region query code (0 on success).
+    VSReturnCode task_regions(VSTaskHandle task, std::vector<vs::SmapsRegion> &regions);
+
+    // The pid a handle was opened for, or -1.
+    int32_t task_pid(VSTaskHandle task);
+
+private:
+    struct Task;
+    struct KernelArrays;
+
+    std::shared_ptr<Task> _task(VSTaskHandle handle);
+    VSTaskHandle _registerTask(std::shared_ptr<Task> task);
+    // Parses smaps once per task; returns the region query code.
+    VSReturnCode _ensureParsed(Task &task);
+    VSReturnCode _parse(Task &task);
+    const std::vector<uint64_t> &_tmpfsDevices();
+
+    uint64_t _pageSize;
+    std::mutex _tasksMutex;
+    std::unordered_map<VSTaskHandle, std::shared_ptr<Task>> _tasks;
+    VSTaskHandle _lastHandle = 0;
+
+    std::once_flag _tmpfsOnce;
+    std::vector<uint64_t> _tmpfs;
+
+    std::once_flag _kpageflagsOnce;
+    int _kpageflagsFd = -1;
+
+    std::once_flag _swapOnce;
+    bool _swapConfigured = false;
+
+    std::mutex _kernelArraysMutex;
+    std::vector<std::shared_ptr<KernelArrays>> _kernelArrays;
+};

@@ -1,0 +1,117 @@
+#include "targets/platform/linux/proc_reader.h"
+
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <unistd.h>
+
+namespace vs {
+
+namespace {
+
+// Large enough for the smaps of most processes in one or two reads.
+constexpr size_t kInitialBuffer = 256 * 1024;
+
+} // namespace
+
+void ReadBuffer::reserve(size_t bytes) {
+    if (bytes <= _capacity) {
+        return;
+    }
+    auto grown = std::make_unique_for_overwrite<char[]>(bytes);
+    _data = std::move(grown);
+    _capacity = bytes;
+}
+
+ReadBuffer &threadReadBuffer() {
+    thread_local ReadBuffer buffer;
+    return buffer;
+}
+
+int readAll(int fd, ReadBuffer &buffer, std::string_view &text) {
+    if (buffer.capacity() == 0) {
+        buffer.reserve(kInitialBuffer);
+    }
+    size_t used = 0;
+    for (;;) {
+        if (used == buffer.capacity()) {
+            // Keep what was read: growing must not lose the first part.
+            ReadBuffer bigger;
+            bigger.reserve(buffer.capacity() * 2);
+            std::memcpy(bigger.data(), buffer.data(), used);
+            buffer = std::move(bigger);
+        }
+        const ssize_t n = ::pread(fd, buffer.data() + used, buffer.capacity() - used,
+                                  static_cast<off_t>(used));
+        if (n < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            return errno;
+        }
+        if (n == 0) {
+            break;
+        }
+        used += static_cast<size_t>(n);
+    }
+    text = std::string_view(buffer.data(), used);
+    return 0;
+}
+
+int readFileAt(int dirFd, const char *name, ReadBuffer &buffer, std::string_view &text) {
+    const int fd = ::openat(dirFd, name, O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
+        return errno;
+    }
+    const int error = readAll(fd, buffer, text);
+    ::close(fd);
+    return error;
+}
+
+int readFileAt(int dirFd, const char *name, std::string_view &text) {
+    return readFileAt(dirFd, name, threadReadBuffer(), text);
+}
+
+int64_t readBytesAt(int dirFd, const char *name, uint64_t offset, void *out, size_t size) {
+    const int fd = ::openat(dirFd, name, O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
+        return -errno;
+    }
+    size_t done = 0;
+    while (done < size) {
+        const ssize_t n = ::pread(fd, static_cast<char *>(out) + done, size - done,
+                                  static_cast<off_t>(offset + done));
+        if (n < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            const int error = errno;
+            ::close(fd);
+            return done > 0 ? static_cast<int64_t>(done) : -error;
+        }
+        if (n == 0) {
+            break;
+        }
+        done += static_cast<size_t>(n);
+    }
+    ::close(fd);
+    return static_cast<int64_t>(done);
+}
+
+UniqueFd &UniqueFd::operator=(UniqueFd &&other) noexcept {
+    if (this != &other) {
+        if (_fd >= 0) {
+            ::close(_fd);
+        }
+        _fd = other.release();
+    }
+    return *this;
+}
+
+UniqueFd::~UniqueFd() {
+    if (_fd >= 0) {
+        ::close(_fd);
+    }
+}
+
+} // namespace vs

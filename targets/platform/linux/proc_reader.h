@@ -1,0 +1,70 @@
+#pragma once
+
+// Reading /proc files whole. Every read goes through openat() on a held
+// /proc/PID directory fd: once the process is reaped every open through
+// that fd fails with ESRCH, so a reused pid is never read by mistake.
+//
+// Files are read with a few large pread() calls into a buffer that belongs
+// to the calling thread and is reused for every file it reads; the text
+// stays valid until the same thread's next read.
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <string_view>
+
+namespace vs {
+
+class ReadBuffer {
+public:
+    char *data() { return _data.get(); }
+    size_t capacity() const { return _capacity; }
+    void reserve(size_t bytes);
+
+private:
+    std::unique_ptr<char[]> _data;
+    size_t _capacity = 0;
+};
+
+// The buffer of the calling thread.
+ReadBuffer &threadReadBuffer();
+
+// Reads all of an open fd from offset 0 into `buffer`. On success returns 0
+// and sets `text`; otherwise returns the errno.
+int readAll(int fd, ReadBuffer &buffer, std::string_view &text);
+
+// Opens `name` relative to `dirFd` (AT_FDCWD for absolute paths), reads it
+// whole into the thread's buffer and closes it. Returns 0 or the errno.
+int readFileAt(int dirFd, const char *name, std::string_view &text);
+
+// Same, into the given buffer.
+int readFileAt(int dirFd, const char *name, ReadBuffer &buffer, std::string_view &text);
+
+// Reads up to `size` bytes at `offset` of `name` under `dirFd` into `out`.
+// Returns the bytes read, or -errno.
+int64_t readBytesAt(int dirFd, const char *name, uint64_t offset, void *out, size_t size);
+
+// An fd closed on destruction.
+class UniqueFd {
+public:
+    UniqueFd() = default;
+    explicit UniqueFd(int fd) : _fd(fd) {}
+    UniqueFd(UniqueFd &&other) noexcept : _fd(other.release()) {}
+    UniqueFd &operator=(UniqueFd &&other) noexcept;
+    UniqueFd(const UniqueFd &) = delete;
+    UniqueFd &operator=(const UniqueFd &) = delete;
+    ~UniqueFd();
+
+    int get() const { return _fd; }
+    bool valid() const { return _fd >= 0; }
+    int release() {
+        const int fd = _fd;
+        _fd = -1;
+        return fd;
+    }
+
+private:
+    int _fd = -1;
+};
+
+} // namespace vs

@@ -1,0 +1,52 @@
+#pragma once
+
+// Parsers for the small per-process files of /proc: stat, status, syscall
+// and the mount table. Pure functions over text, so they are tested on
+// recorded samples.
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace vs {
+
+// The fields of /proc/PID/stat this program reads. The command name sits
+// in parentheses and may itself hold ')' and blanks, so the fields after it
+// are counted from the last ')' of the line.
+struct ProcStat {
+    int32_t pid = 0;
+    std::string comm;
+    char state = '?';
+    int32_t ppid = 0;
+    uint64_t flags = 0; // PF_* bits
+    uint64_t numThreads = 0;
+};
+
+inline constexpr uint64_t kLinuxKernelThreadFlag = 0x00200000; // PF_KTHREAD
+
+std::optional<ProcStat> parseStat(std::string_view text);
+
+// The text after "Name:" of a status line, blanks trimmed; nullopt when the
+// line is missing.
+std::optional<std::string_view> statusValue(std::string_view status, std::string_view name);
+
+// A "Name:   123 kB" status line in bytes (a plain number without unit is
+// returned as it stands); nullopt when the line is missing.
+std::optional<uint64_t> statusBytes(std::string_view status, std::string_view name);
+
+// The stack pointer of a thread from task/TID/syscall: the second-to-last
+// field. nullopt while the thread is running on a processor ("running"),
+// and for text that does not look like the file.
+std::optional<uint64_t> parseSyscallStackPointer(std::string_view text);
+
+// Device numbers (major << 32 | minor) of the tmpfs mounts listed in a
+// mountinfo text.
+std::vector<uint64_t> parseTmpfsDevices(std::string_view mountinfo);
+
+// Number of NUL-terminated strings in a cmdline text; a missing final NUL
+// (a process that rewrote its arguments) still counts the last string.
+uint32_t countArguments(std::string_view cmdline);
+
+} // namespace vs

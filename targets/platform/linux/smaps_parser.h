@@ -1,0 +1,104 @@
+#pragma once
+
+// Parser for /proc/PID/smaps (and /proc/PID/maps, which is the header lines
+// of smaps alone). The text is one header line per mapping
+//
+//   start-end perms offset major:minor inode    path
+//
+// followed by "Name:   N kB" field lines and a "VmFlags:" line. Addresses,
+// offset and device numbers are hex, the inode is decimal, the path runs to
+// the end of the line and may hold blanks, " (deleted)" or a bracketed
+// pseudo name. Header lines start with a hex digit, field names with an
+// upper-case letter, which is how the two are told apart.
+//
+// The input may be cut short (a read that raced with the process exiting):
+// a line without its terminating newline is ignored, so a half-printed
+// number never becomes a wrong size.
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace vs {
+
+// The two-letter VmFlags this program reads, one bit each.
+inline constexpr uint64_t kVmRead = 1ull << 0; // rd
+inline constexpr uint64_t kVmWrite = 1ull << 1; // wr
+inline constexpr uint64_t kVmExec = 1ull << 2; // ex
+inline constexpr uint64_t kVmShared = 1ull << 3; // sh
+inline constexpr uint64_t kVmMayRead = 1ull << 4; // mr
+inline constexpr uint64_t kVmMayWrite = 1ull << 5; // mw
+inline constexpr uint64_t kVmMayExec = 1ull << 6; // me
+inline constexpr uint64_t kVmMayShare = 1ull << 7; // ms
+inline constexpr uint64_t kVmGrowsDown = 1ull << 8; // gd
+inline constexpr uint64_t kVmPfnMap = 1ull << 9; // pf
+inline constexpr uint64_t kVmLocked = 1ull << 10; // lo
+inline constexpr uint64_t kVmIo = 1ull << 11; // io
+inline constexpr uint64_t kVmDontCopy = 1ull << 12; // dc
+inline constexpr uint64_t kVmDontExpand = 1ull << 13; // de
+inline constexpr uint64_t kVmAccount = 1ull << 14; // ac
+inline constexpr uint64_t kVmNoReserve = 1ull << 15; // nr
+inline constexpr uint64_t kVmHugetlb = 1ull << 16; // ht
+inline constexpr uint64_t kVmDontDump = 1ull << 17; // dd
+inline constexpr uint64_t kVmMixedMap = 1ull << 18; // mm
+inline constexpr uint64_t kVmHugePage = 1ull << 19; // hg
+inline constexpr uint64_t kVmNoHugePage = 1ull << 20; // nh
+inline constexpr uint64_t kVmMergeable = 1ull << 21; // mg
+inline constexpr uint64_t kVmSealed = 1ull << 22; // sl
+inline constexpr uint64_t kVmWipeOnFork = 1ull << 23; // wf
+inline constexpr uint64_t kVmLockOnFault = 1ull << 24; // lf
+inline constexpr uint64_t kVmSoftDirty = 1ull << 25; // sd
+
+// Bit of a two-letter VmFlags name, 0 for names this program ignores.
+uint64_t vmFlagBit(char first, char second);
+
+// One mapping. Sizes are in bytes (the file prints kB).
+struct SmapsRegion {
+    uint64_t start = 0;
+    uint64_t end = 0;
+    uint64_t offset = 0;
+    uint64_t inode = 0;
+    uint32_t devMajor = 0;
+    uint32_t devMinor = 0;
+    bool read = false;
+    bool write = false;
+    bool exec = false;
+    bool shared = false; // 's' in the perms, else 'p'
+    std::string path;    // as printed, empty for plain anonymous memory
+
+    uint64_t rss = 0;
+    uint64_t sharedClean = 0;
+    uint64_t sharedDirty = 0;
+    uint64_t privateClean = 0;
+    uint64_t privateDirty = 0;
+    uint64_t lazyFree = 0;
+    uint64_t swap = 0;
+    uint64_t locked = 0;
+    uint64_t vmFlags = 0;
+    bool hasVmFlags = false; // false for maps lines and cut-short records
+
+    uint64_t size() const { return end - start; }
+    bool hasFlag(uint64_t bit) const { return (vmFlags & bit) != 0; }
+};
+
+// Appends every mapping of `text` to `out` (which is not cleared) and
+// returns the number appended. Never fails: unparseable lines are skipped.
+size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out);
+
+// What kind of memory a mapping is, from its path, device and inode. The
+// shmem family (tmpfs files, memfd, SysV segments, shared anonymous memory
+// shown as "/dev/zero (deleted)") has pages that cannot be dropped, so it
+// never counts as backed by an external pager.
+enum class MappingKind : uint8_t {
+    Anonymous,    // no inode: heap, stacks, private anonymous memory
+    File,         // a regular file on a disk file system
+    SharedMemory, // shmem family
+    Special,      // [vdso], [vvar], [vvar_vclock], [vsyscall]
+};
+
+// `tmpfsDevices` are the device numbers (major << 32 | minor) of the mounted
+// tmpfs file systems; pass an empty list to recognise shmem by name only.
+MappingKind mappingKind(const SmapsRegion &region, const std::vector<uint64_t> &tmpfsDevices);
+
+} // namespace vs
