@@ -599,6 +599,34 @@ TEST_F(LinuxProcessTest, CrashHelperFindsThePidfdOnDescriptorThree) {
     child.end();
 }
 
+TEST_F(LinuxProcessTest, SmapsLargerThanTheFirstReadIsReadWhole) {
+    // 600 mappings print far more smaps text than the first read takes;
+    // alternating protections keep the kernel from merging them.
+    constexpr size_t kMappings = 600;
+    char *base = static_cast<char *>(
+        mmap(nullptr, kMappings * kPage, PROT_READ, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
+    ASSERT_NE(base, MAP_FAILED);
+    for (size_t i = 0; i < kMappings; i += 2) {
+        ASSERT_EQ(mprotect(base + i * kPage, kPage, PROT_READ | PROT_WRITE), 0);
+        base[i * kPage] = 1;
+    }
+    VSTaskHandle task = 0;
+    ASSERT_EQ(platform.task_handle_for_pid(getpid(), task), 0);
+    std::vector<WalkedRegion> regions;
+    EXPECT_EQ(walk(platform, task, regions), vs::kReturnNoMoreRegions);
+    size_t found = 0;
+    for (size_t i = 0; i < kMappings; ++i) {
+        const WalkedRegion *r = containing(regions, reinterpret_cast<uint64_t>(base + i * kPage));
+        if (r != nullptr && r->start == reinterpret_cast<uint64_t>(base + i * kPage) && r->size == kPage) {
+            ++found;
+            EXPECT_EQ(r->info.residentPages, i % 2 == 0 ? 1u : 0u) << i;
+        }
+    }
+    EXPECT_EQ(found, kMappings);
+    platform.release_task_handle(task);
+    munmap(base, kMappings * kPage);
+}
+
 TEST_F(LinuxProcessTest, KernelMemoryAndSettings) {
     std::span<const VSKernelZoneName> names;
     std::span<const VSKernelZoneInfo> zones;

@@ -343,10 +343,9 @@ int32_t VSLinuxPlatform::pid_region_filename(int32_t pid, uint64_t address,
     std::vector<std::shared_ptr<Task>> candidates;
     {
         std::lock_guard<std::mutex> lock(_tasksMutex);
-        for (auto &[handle, task] : _tasks) {
-            if (task->pid == pid) {
-                candidates.push_back(task);
-            }
+        auto [first, last] = _handlesByPid.equal_range(pid);
+        for (auto it = first; it != last; ++it) {
+            candidates.push_back(_tasks.at(it->second));
         }
     }
     for (auto &task : candidates) {
@@ -452,6 +451,7 @@ VSTaskHandle VSLinuxPlatform::_registerTask(std::shared_ptr<Task> task) {
         ++_lastHandle;
     } while (_lastHandle == vs::kTaskHandleNone || _lastHandle == vs::kPortDead ||
              _tasks.count(_lastHandle) != 0);
+    _handlesByPid.emplace(task->pid, _lastHandle);
     _tasks.emplace(_lastHandle, std::move(task));
     return _lastHandle;
 }
@@ -480,7 +480,19 @@ VSReturnCode VSLinuxPlatform::task_handle_for_pid(int32_t pid, VSTaskHandle &tas
 
 VSReturnCode VSLinuxPlatform::release_task_handle(VSTaskHandle task) {
     std::lock_guard<std::mutex> lock(_tasksMutex);
-    return _tasks.erase(task) == 1 ? 0 : EBADF;
+    auto it = _tasks.find(task);
+    if (it == _tasks.end()) {
+        return EBADF;
+    }
+    auto [first, last] = _handlesByPid.equal_range(it->second->pid);
+    for (auto byPid = first; byPid != last; ++byPid) {
+        if (byPid->second == task) {
+            _handlesByPid.erase(byPid);
+            break;
+        }
+    }
+    _tasks.erase(it);
+    return 0;
 }
 
 const std::vector<uint64_t> &VSLinuxPlatform::_tmpfsDevices() {

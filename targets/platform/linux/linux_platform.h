@@ -81,8 +81,7 @@ public:
     int32_t own_pid() override;
     uint32_t effective_user_id() override;
 
-    // Where the layer finds procfs; tests point it at nothing else, but
-    // keeping the root in one place keeps every path relative to it.
+    // Where procfs is mounted.
     static constexpr const char *kProcRoot = "/proc";
 
     // The regions of a task as parsed from smaps, for tests and tools that
@@ -107,6 +106,8 @@ private:
     uint64_t _pageSize;
     std::mutex _tasksMutex;
     std::unordered_map<VSTaskHandle, std::shared_ptr<Task>> _tasks;
+    // The walk asks for file names by pid; this finds the parse to answer from.
+    std::unordered_multimap<int32_t, VSTaskHandle> _handlesByPid;
     VSTaskHandle _lastHandle = 0;
 
     std::once_flag _tmpfsOnce;
