@@ -1,0 +1,23 @@
+#include "analysis/sharing.h"
+
+#include <algorithm>
+
+#include "targets/process.h"
+
+namespace vs {
+
+bool ProcessGroupLess::operator()(const VSProcessGroup &a, const VSProcessGroup &b) const {
+    if (a.size() != b.size()) {
+        return a.size() < b.size();
+    }
+    return std::lexicographical_compare(a.begin(), a.end(), b.begin(), b.end(),
+                                        [](const VSProcess *x, const VSProcess *y) { return x->pid() < y->pid(); });
+}
+
+} // namespace vs
+
+void VSVestageSharingData::adoptMemoryObjects(std::vector<std::unique_ptr<VSMemoryObject>> objects) {
+    for (std::unique_ptr<VSMemoryObject> &object : objects) {
+        _ownedObjects.push_back(std::move(object));
+    }
+}

@@ -1,0 +1,457 @@
+#include "analysis/vestage.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <unordered_set>
+
+#include "analysis/work_queue.h"
+#include "model/memory_category.h"
+
+namespace {
+
+constexpr const char *kGatherQueueLabel = "org.vestage.gatherdata";
+constexpr const char *kBreakDownSetting = "vm.self_region_vestage";
+constexpr const char *kEarlyExitError = "Vestage exited early due to SIGINT and did not finish gathering all data";
+constexpr std::uint64_t kFoldLimit = 1048576;
+
+void reportSystemError(const char *text, int32_t error) {
+    std::fprintf(stderr, "%s: %s\n", text, std::strerror(error));
+}
+
+bool isImageSegment(VSSegmentKind segment) {
+    return segment == VSSegmentText || segment == VSSegmentData || segment == VSSegmentLinkedit;
+}
+
+// Small or image-segment categories that only clutter a summarized table.
+// Purgeable non-volatile memory with clean pages stays visible: it is
+// memory the program chose to keep.
+bool isFoldable(const VSMemoryCategory &category) {
+    const std::uint64_t dirty = category.totalDirtySize() + category.totalSwappedSize();
+    if (!isImageSegment(category.segment()) && dirty != 0) {
+        return false;
+    }
+    if (dirty > kFoldLimit) {
+        return false;
+    }
+    return !(category.purgeableNonVolatile() && category.totalCleanSize() != 0);
+}
+
+void addToTotals(VSCategoryTotals &totals, const VSMemoryCategory &category) {
+    totals.dirty += category.totalDirtySize();
+    totals.swapped += category.totalSwappedSize();
+    totals.clean += category.totalCleanSize();
+    totals.reclaimable += category.totalReclaimableSize();
+    totals.wired += category.totalWiredSize();
+    totals.regions += static_cast<std::uint32_t>(category.totalRegions());
+}
+
+} // namespace
+
+VSVestage::VSVestage(std::vector<std::unique_ptr<VSProcess>> processes) : _processes(std::move(processes)) {}
+
+VSVestage::~VSVestage() = default;
+
+void VSVestage::addOutputFormatter(std::unique_ptr<VSOutputFormatter> formatter) {
+    _outputFormatters.push_back(std::move(formatter));
+}
+
+// ---- gathering ------------------------------------------------------------------
+
+void VSVestage::gatherData() {
+    vs::WorkQueue queue(kGatherQueueLabel, _gatherWidth);
+    const std::vector<VSProcess *> order = _getProcessListSortedByPidDesc();
+    queue.parallel_for(order.size(), [&](std::size_t index) {
+        if (!_earlyExit.load()) {
+            order[index]->gatherData();
+        }
+    });
+    if (_earlyExit.load()) {
+        VSProcess::_addGlobalError(kEarlyExitError);
+    }
+    for (const std::unique_ptr<VSProcess> &process : _processes) {
+        _addProcess(*process);
+    }
+    calculateSizes();
+    _buildProcessToVestageMap();
+}
+
+void VSVestage::_addProcess(VSProcess &process) {
+    for (const std::unique_ptr<VSMemoryRegion> &owned : process.memoryRegions()) {
+        VSMemoryRegion &region = *owned;
+        std::uint64_t key;
+        MemoryObjectTable *table;
+        if (region.inSharedCache()) {
+            key = region.start();
+            table = process.is64bit() ? &_sharedCache64MemoryObjects : &_sharedCache32MemoryObjects;
+        } else {
+            key = region.object_id();
+            switch (region.segment()) {
+            case VSSegmentText:
+                table = &_textMemoryObjects;
+                break;
+            case VSSegmentLinkedit:
+                table = &_linkeditMemoryObjects;
+                break;
+            default:
+                table = &_memoryObjects;
+                break;
+            }
+        }
+        if (region.share_mode() == vs::kShareModeCopyOnWrite &&
+            (region.dirtySize() != 0 || region.swappedSize() != 0)) {
+            key ^= static_cast<std::uint64_t>(static_cast<std::uint32_t>(process.pid())) << 32;
+        }
+        VSMemoryObject *object;
+        if (key != 0) {
+            std::unique_ptr<VSMemoryObject> &slot = (*table)[key];
+            if (!slot) {
+                slot = std::make_unique<VSMemoryObject>();
+            }
+            object = slot.get();
+        } else {
+            _uniqueMemoryObjects.push_back(std::make_unique<VSMemoryObject>());
+            object = _uniqueMemoryObjects.back().get();
+        }
+        object->addRegion(&region, process.pageSize());
+        region.setMemoryObject(object);
+    }
+}
+
+void VSVestage::calculateSizes() {
+    for (const MemoryObjectTable *table : {&_memoryObjects, &_sharedCache32MemoryObjects, &_sharedCache64MemoryObjects}) {
+        for (const auto &entry : *table) {
+            entry.second->calculateSizes();
+        }
+    }
+    for (const std::unique_ptr<VSMemoryObject> &object : _uniqueMemoryObjects) {
+        object->calculateSizes();
+    }
+    for (const MemoryObjectTable *table : {&_textMemoryObjects, &_linkeditMemoryObjects}) {
+        for (const auto &entry : *table) {
+            entry.second->calculateSizes();
+        }
+    }
+}
+
+// ---- interrupt and breakdown switch ---------------------------------------------
+
+std::unique_ptr<vs::InterruptSource> VSVestage::installCancelHandler(std::function<void()> callback) {
+    if (vs::standardOutputIsTerminal()) {
+        return nullptr;
+    }
+    return std::make_unique<vs::InterruptSource>(std::move(callback));
+}
+
+// The targets read the same setting through the process layer, which does
+// the reading for both.
+bool VSVestage::breakDownPhysVestage() { return vs::readBreakDownPhysVestageSetting(); }
+
+void VSVestage::setBreakDownPhysVestage(bool enabled) {
+    const std::int32_t error = VSPlatform::current().sysctl_by_name_write(kBreakDownSetting, enabled ? 1 : 0);
+    if (error != 0 && error != ENOENT) {
+        reportSystemError("Unable to configure physical vestage data collection", error);
+    }
+}
+
+// ---- categories -------------------------------------------------------------------
+
+VSCategoryTable VSVestage::_categoriesForAllProcesses() const {
+    VSCategoryTable table;
+    std::unordered_set<const VSMemoryObject *> placed;
+    for (const std::unique_ptr<VSProcess> &process : _processes) {
+        for (const std::unique_ptr<VSMemoryRegion> &region : process->memoryRegions()) {
+            VSMemoryObject *object = region->memoryObject();
+            if (object == nullptr || !placed.insert(object).second) {
+                continue;
+            }
+            const std::string name = region->name().value_or("");
+            auto found = table.find(name);
+            if (found == table.end()) {
+                found = table.emplace(name, VSMemoryCategory(name, region->segment())).first;
+            }
+            found->second.addMemoryObject(object);
+        }
+    }
+    return table;
+}
+
+VSCategoryTable VSVestage::_categoriesForObjects(const std::vector<VSMemoryObject *> &objects) const {
+    VSCategoryTable table;
+    for (VSMemoryObject *object : objects) {
+        const std::string name = object->name().value_or("");
+        auto found = table.find(name);
+        if (found == table.end()) {
+            const vs::RegionSet &regions = object->memoryRegions();
+            const VSSegmentKind segment = regions.empty() ? VSSegmentUnknown : (*regions.begin())->segment();
+            found = table.emplace(name, VSMemoryCategory(name, segment)).first;
+        }
+        found->second.addMemoryObject(object);
+    }
+    return table;
+}
+
+VSCategoryTable VSVestage::_summarizedCategoriesForCategories(VSCategoryTable categories, bool summarize,
+                                                              VSCategoryTotals &outTotal) {
+    outTotal = VSCategoryTotals{};
+    VSCategoryTable result;
+    VSMemoryCategory other("Other", VSSegmentNone);
+    for (auto &[name, category] : categories) {
+        addToTotals(outTotal, category);
+        if (summarize && isFoldable(category)) {
+            for (VSMemoryObject *object : category.memoryObjects()) {
+                other.addMemoryObject(object);
+            }
+        } else {
+            result.insert_or_assign(name, std::move(category));
+        }
+    }
+    if (!other.memoryObjects().empty()) {
+        result.insert_or_assign("Other", std::move(other));
+    }
+    return result;
+}
+
+VSSortedCategoryKeys VSVestage::_sortedKeysForCategories(const VSCategoryTable &categories) {
+    VSSortedCategoryKeys keys;
+    keys.reserve(categories.size());
+    for (const auto &entry : categories) {
+        keys.push_back(entry.first);
+    }
+    // The table iterates in name order and the sort is stable, so equal
+    // categories stay in name order.
+    std::stable_sort(keys.begin(), keys.end(), [&](const std::string &a, const std::string &b) {
+        const VSMemoryCategory &x = categories.at(a);
+        const VSMemoryCategory &y = categories.at(b);
+        const std::uint64_t dirtyX = x.totalDirtySize() + x.totalSwappedSize();
+        const std::uint64_t dirtyY = y.totalDirtySize() + y.totalSwappedSize();
+        if (dirtyX != dirtyY) {
+            return dirtyX > dirtyY;
+        }
+        if (x.totalReclaimableSize() != y.totalReclaimableSize()) {
+            return x.totalReclaimableSize() > y.totalReclaimableSize();
+        }
+        return x.totalCleanSize() > y.totalCleanSize();
+    });
+    return keys;
+}
+
+// ---- vestage and orderings ------------------------------------------------------------
+
+std::uint64_t VSVestage::_calculateVestageForProcess(const VSProcess &process) const {
+    std::uint64_t vestage = 0;
+    std::unordered_set<const VSMemoryObject *> counted;
+    for (const std::unique_ptr<VSMemoryRegion> &region : process.memoryRegions()) {
+        const VSMemoryObject *object = region->memoryObject();
+        if (object != nullptr && counted.insert(object).second) {
+            vestage += object->totalDirtySize() + object->totalSwappedSize();
+        }
+    }
+    return vestage;
+}
+
+void VSVestage::_buildProcessToVestageMap() {
+    _pidToVestage.clear();
+    for (const std::unique_ptr<VSProcess> &process : _processes) {
+        _pidToVestage[process->pid()] = _calculateVestageForProcess(*process);
+    }
+}
+
+std::vector<VSProcess *> VSVestage::_getProcessListSortedByPidDesc() const {
+    std::vector<VSProcess *> list;
+    list.reserve(_processes.size());
+    for (const std::unique_ptr<VSProcess> &process : _processes) {
+        list.push_back(process.get());
+    }
+    std::stable_sort(list.begin(), list.end(),
+                     [](const VSProcess *a, const VSProcess *b) { return a->pid() > b->pid(); });
+    return list;
+}
+
+std::vector<VSProcess *> VSVestage::_getProcessListSortedByVestage() const {
+    auto vestageOf = [this](const VSProcess *process) -> std::uint64_t {
+        auto found = _pidToVestage.find(process->pid());
+        return found == _pidToVestage.end() ? 0 : found->second;
+    };
+    std::vector<VSProcess *> list = _getProcessListSortedByPidDesc();
+    std::stable_sort(list.begin(), list.end(),
+                     [&](const VSProcess *a, const VSProcess *b) { return vestageOf(a) > vestageOf(b); });
+    return list;
+}
+
+// ---- sharing ------------------------------------------------------------------------------
+
+std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
+    // Phase one: the group of every object, objects in the order first met.
+    std::vector<std::pair<VSMemoryObject *, VSProcessGroup>> objectToProcesses;
+    std::unordered_map<const VSMemoryObject *, std::size_t> indexOfObject;
+    for (const std::unique_ptr<VSProcess> &process : _processes) {
+        for (const std::unique_ptr<VSMemoryRegion> &region : process->memoryRegions()) {
+            VSMemoryObject *object = region->memoryObject();
+            if (object == nullptr) {
+                continue;
+            }
+            auto [found, added] = indexOfObject.try_emplace(object, objectToProcesses.size());
+            if (added) {
+                objectToProcesses.emplace_back(object, VSProcessGroup{});
+            }
+            VSProcessGroup &group = objectToProcesses[found->second].second;
+            // Members are distinct by pid; the first target with a pid stays.
+            const bool member = std::any_of(group.begin(), group.end(), [&](const VSProcess *p) {
+                return p->pid() == process->pid();
+            });
+            if (!member) {
+                group.push_back(process.get());
+            }
+        }
+    }
+
+    // Phase two: objects by group, groups by target.
+    VSVestageSharingData::ProcessGroupToObjects processGroupToObjects;
+    VSVestageSharingData::ProcessToProcessGroups processToProcessGroups;
+    for (auto &[object, group] : objectToProcesses) {
+        std::stable_sort(group.begin(), group.end(),
+                         [](const VSProcess *a, const VSProcess *b) { return a->pid() < b->pid(); });
+        processGroupToObjects[group].insert(object);
+        for (const VSProcess *member : group) {
+            processToProcessGroups[member->asNumber()].insert(group);
+        }
+    }
+
+    auto sharing = std::make_unique<VSVestageSharingData>();
+    sharing->setProcessToProcessGroups(std::move(processToProcessGroups));
+    sharing->setProcessGroupToObjects(std::move(processGroupToObjects));
+    return sharing;
+}
+
+void VSVestage::_releaseMemoryObjectsTo(VSVestageSharingData &sharing) {
+    MemoryObjectList objects;
+    for (MemoryObjectTable *table : {&_memoryObjects, &_sharedCache64MemoryObjects, &_sharedCache32MemoryObjects,
+                                     &_textMemoryObjects, &_linkeditMemoryObjects}) {
+        for (auto &entry : *table) {
+            objects.push_back(std::move(entry.second));
+        }
+        table->clear();
+    }
+    for (std::unique_ptr<VSMemoryObject> &object : _uniqueMemoryObjects) {
+        objects.push_back(std::move(object));
+    }
+    _uniqueMemoryObjects.clear();
+    sharing.adoptMemoryObjects(std::move(objects));
+}
+
+// ---- report --------------------------------------------------------------------------------
+
+void VSVestage::printSpanlistLikeOutputForProcesses(const std::vector<const VSProcess *> &processes) {
+    std::vector<VSOutputFormatter *> listers;
+    for (const std::unique_ptr<VSOutputFormatter> &formatter : _outputFormatters) {
+        if (formatter->implementsOperation(VSOptionalFormatterOperation::printSpanlistLikeOutputForProcess)) {
+            listers.push_back(formatter.get());
+        }
+    }
+    if (listers.empty()) {
+        return;
+    }
+    for (const VSProcess *process : processes) {
+        std::vector<const VSMemoryRegion *> regions;
+        regions.reserve(process->memoryRegions().size());
+        for (const std::unique_ptr<VSMemoryRegion> &region : process->memoryRegions()) {
+            regions.push_back(region.get());
+        }
+        std::stable_sort(regions.begin(), regions.end(),
+                         [](const VSMemoryRegion *a, const VSMemoryRegion *b) { return a->start() < b->start(); });
+        for (VSOutputFormatter *formatter : listers) {
+            formatter->printSpanlistLikeOutputForProcess(*process, regions);
+        }
+    }
+}
+
+void VSVestage::printOutputVerbose(bool verbose, bool summarize) {
+    const std::vector<VSProcess *> sorted = _getProcessListSortedByVestage();
+    const std::vector<const VSProcess *> processes(sorted.begin(), sorted.end());
+    if (verbose) {
+        printSpanlistLikeOutputForProcesses(processes);
+    }
+
+    // From here on the sharing record keeps the memory objects alive; the
+    // collections are not needed again and their memory goes back before
+    // printing starts.
+    const std::unique_ptr<VSVestageSharingData> sharing = _sharingData();
+    _releaseMemoryObjectsTo(*sharing);
+
+    std::vector<const VSProcess *> processesWithWarnings;
+    std::vector<const VSProcess *> processesWithErrors;
+    std::shared_ptr<const VSAuxDataDictionary> mergedAuxData;
+    VSCategoryTotals totals;
+
+    for (const VSProcess *process : processes) {
+        const bool hasErrors = !process->errors().empty();
+        if (!process->warnings().empty()) {
+            processesWithWarnings.push_back(process);
+        }
+        const std::shared_ptr<const VSAuxDataDictionary> auxData = process->auxData();
+        if (hasErrors) {
+            processesWithErrors.push_back(process);
+        } else if (auxData) {
+            mergedAuxData = auxData->mergeWithData(mergedAuxData.get());
+        }
+        auto vestage = _pidToVestage.find(process->pid());
+        const std::uint64_t total = vestage == _pidToVestage.end() ? 0 : vestage->second;
+
+        for (const std::unique_ptr<VSOutputFormatter> &formatter : _outputFormatters) {
+            formatter->printProcessHeader(*process);
+            if (!hasErrors) {
+                formatter->printProcessTotal(total, *process);
+            }
+            formatter->endProcessHeader(*process);
+        }
+        if (hasErrors) {
+            continue;
+        }
+
+        // The memory the process alone maps first, then each group it
+        // shares with, in group order.
+        std::vector<const VSProcessGroup *> groups;
+        auto found = sharing->processToProcessGroups().find(process->asNumber());
+        if (found != sharing->processToProcessGroups().end()) {
+            for (const VSProcessGroup &group : found->second) {
+                if (group.size() == 1) {
+                    groups.insert(groups.begin(), &group);
+                } else {
+                    groups.push_back(&group);
+                }
+            }
+        }
+        for (const VSProcessGroup *group : groups) {
+            const vs::MemoryObjectSet &objects = sharing->processGroupToObjects().at(*group);
+            VSCategoryTable categories =
+                _summarizedCategoriesForCategories(_categoriesForObjects(objects.items()), summarize, totals);
+            const VSSortedCategoryKeys keys = _sortedKeysForCategories(categories);
+            for (const std::unique_ptr<VSOutputFormatter> &formatter : _outputFormatters) {
+                if (group->size() == 1) {
+                    formatter->printProcessCategories(categories, keys, totals);
+                } else if (formatter->implementsOperation(VSOptionalFormatterOperation::printSharedCategories)) {
+                    formatter->printSharedCategories(categories, keys, *group, *process, totals);
+                }
+            }
+        }
+        for (const std::unique_ptr<VSOutputFormatter> &formatter : _outputFormatters) {
+            formatter->printProcessAuxData(auxData.get());
+        }
+    }
+
+    const std::vector<std::string> globalErrors = VSProcess::globalErrors();
+    for (const std::unique_ptr<VSOutputFormatter> &formatter : _outputFormatters) {
+        formatter->printProcessesWithWarnings(processesWithWarnings, processesWithErrors, globalErrors);
+    }
+
+    const VSCategoryTable summary = _summarizedCategoriesForCategories(_categoriesForAllProcesses(), summarize, totals);
+    const VSSortedCategoryKeys summaryKeys = _sortedKeysForCategories(summary);
+    const bool hadErrors = !globalErrors.empty() || !processesWithErrors.empty();
+    for (const std::unique_ptr<VSOutputFormatter> &formatter : _outputFormatters) {
+        formatter->printSummaryCategories(summary, summaryKeys, totals, hadErrors);
+        formatter->printGlobalAuxData(mergedAuxData.get());
+        formatter->end();
+    }
+}
