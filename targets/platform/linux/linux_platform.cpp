@@ -16,6 +16,7 @@
 #include <dirent.h>
 #include <elf.h>
 #include <fcntl.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -161,7 +162,15 @@ int readPidFile(int32_t pid, const char *name, std::string_view &text) {
 
 } // namespace
 
-VSLinuxPlatform::VSLinuxPlatform() : _pageSize(static_cast<uint64_t>(::sysconf(_SC_PAGESIZE))) {}
+VSLinuxPlatform::VSLinuxPlatform() : _pageSize(static_cast<uint64_t>(::sysconf(_SC_PAGESIZE))) {
+    // Every task handle holds a directory fd for the whole run, and a run
+    // over all processes opens one per process: lift the soft fd limit.
+    rlimit files{};
+    if (::getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
+        files.rlim_cur = files.rlim_max;
+        ::setrlimit(RLIMIT_NOFILE, &files);
+    }
+}
 
 VSLinuxPlatform::~VSLinuxPlatform() {
     if (_kpageflagsFd >= 0) {
