@@ -114,30 +114,37 @@ struct MappedFileContext {
     int dirFd;
 };
 
+// True when `name` under `dirFd` is the regular file with the mapping's
+// inode. Device mappings are never opened: opening a device can act.
+bool isMappedRegularFile(int dirFd, const char *name, const SmapsRegion &region) {
+    struct stat st {};
+    return ::fstatat(dirFd, name, &st, 0) == 0 && S_ISREG(st.st_mode) && st.st_ino == region.inode;
+}
+
 // Reads a file the process maps: through map_files/ (which also reaches
 // deleted files) and, when that is refused, through the process's root.
 int64_t readMappedFile(void *context, const SmapsRegion &region, uint64_t offset, void *out,
                        size_t size) {
     const int dirFd = static_cast<MappedFileContext *>(context)->dirFd;
+    if (region.hasFlag(vs::kVmIo) || region.hasFlag(vs::kVmPfnMap)) {
+        return -ENODEV;
+    }
     char name[64];
     std::snprintf(name, sizeof name, "map_files/%llx-%llx",
                   static_cast<unsigned long long>(region.start),
                   static_cast<unsigned long long>(region.end));
-    int64_t n = vs::readBytesAt(dirFd, name, offset, out, size);
-    if (n >= 0) {
-        return n;
-    }
-    std::string rooted = "root" + region.path;
-    n = vs::readBytesAt(dirFd, rooted.c_str(), offset, out, size);
-    if (n < 0) {
-        return n;
+    if (isMappedRegularFile(dirFd, name, region)) {
+        const int64_t n = vs::readBytesAt(dirFd, name, offset, out, size);
+        if (n >= 0) {
+            return n;
+        }
     }
     // The path may name another file by now; only the mapped inode counts.
-    struct stat st {};
-    if (::fstatat(dirFd, rooted.c_str(), &st, 0) != 0 || st.st_ino != region.inode) {
+    const std::string rooted = "root" + region.path;
+    if (!isMappedRegularFile(dirFd, rooted.c_str(), region)) {
         return -ENOENT;
     }
-    return n;
+    return vs::readBytesAt(dirFd, rooted.c_str(), offset, out, size);
 }
 
 // Index of the first region ending above `address`, or regions.size().
