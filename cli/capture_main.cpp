@@ -12,13 +12,11 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
-#include <map>
 #include <string>
-#include <vector>
 
+#include "cli/heapfile_capture_identities.h"
 #include "targets/heapfile_capture.h"
 #include "targets/platform/linux/linux_platform.h"
-#include "targets/platform/linux/smaps_parser.h"
 
 namespace {
 
@@ -30,29 +28,6 @@ void printCaptureUsage(FILE *out) {
                "  -o, --output DIR   directory for the heapfiles\n"
                "  -h, --help         this text\n",
                out);
-}
-
-// Stable identities of file and kernel-provided mappings, so that
-// heapfiles captured at different times still share what live processes
-// share (a library, the vdso).
-std::map<uint64_t, std::string> linuxRegionIdentities(VSLinuxPlatform &platform, VSTaskHandle task) {
-    std::map<uint64_t, std::string> identities;
-    std::vector<vs::SmapsRegion> regions;
-    if (platform.task_regions(task, regions) != vs::kReturnSuccess) {
-        return identities;
-    }
-    for (const vs::SmapsRegion &region : regions) {
-        const std::string offset = std::to_string(region.offset);
-        if (region.inode != 0) {
-            identities[region.start] = "file " + std::to_string(region.devMajor) + ":" +
-                                       std::to_string(region.devMinor) + " inode " + std::to_string(region.inode) +
-                                       " offset " + offset;
-        } else if (region.path == "[vdso]" || region.path == "[vvar]" || region.path == "[vvar_vclock]" ||
-                   region.path == "[vsyscall]") {
-            identities[region.start] = "kernel mapping " + region.path + " offset " + offset;
-        }
-    }
-    return identities;
 }
 
 bool parsePid(const char *text, int32_t &pid) {
@@ -98,7 +73,7 @@ int main(int argc, char **argv) {
     VSLinuxPlatform platform;
     VSPlatform::setCurrent(&platform);
     const vs::HeapfileCapture capture(
-        [&platform](VSTaskHandle task) { return linuxRegionIdentities(platform, task); });
+        [&platform](VSTaskHandle task) { return vs::linuxRegionIdentities(platform, task); });
 
     int status = 0;
     for (int index = optind; index < argc; ++index) {
