@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "analysis/vestage.h"
+#include "output/json_formatter.h"
 #include "output/text_formatter.h"
 #include "targets/platform/linux/linux_platform.h"
 #include "targets/process.h"
@@ -186,6 +187,9 @@ int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArgum
     }
 
     vestage.addOutputFormatter(std::make_unique<VSOutputFormatterText>(options.summaryFormat, options.outputOptions));
+    if (options.jsonPath) {
+        vestage.addOutputFormatter(std::make_unique<VSOutputFormatterJSON>(*options.jsonPath));
+    }
     vestage.printOutputVerbose(options.verbose, options.summarize);
     return 0;
 }

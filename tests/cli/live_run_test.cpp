@@ -6,6 +6,9 @@
 #include <unistd.h>
 
 #include <cstdint>
+#include <cstdio>
+#include <fstream>
+#include <nlohmann/json.hpp>
 #include <regex>
 #include <string>
 #include <vector>
@@ -122,6 +125,54 @@ TEST(LiveRun, InterruptDuringGatheringStillReports) {
               std::string::npos)
         << run.out;
     EXPECT_NE(run.out.find("TOTAL"), std::string::npos);
+}
+
+TEST(LiveRun, JsonDocumentAgreesWithTheTextReport) {
+    if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
+    MemChild child({"anon:held:256:256"});
+    ASSERT_TRUE(child.ready());
+    char dir[] = "/tmp/vestage-json-XXXXXX";
+    ASSERT_NE(mkdtemp(dir), nullptr);
+    const std::string path = std::string(dir) + "/report.json";
+
+    auto run = runProgram({"-a", "-f", "bytes", "--json", path});
+    ASSERT_EQ(run.status, 0) << run.err;
+    std::ifstream in(path);
+    const nlohmann::json document = nlohmann::json::parse(in, nullptr, false);
+    std::remove(path.c_str());
+    rmdir(dir);
+    ASSERT_FALSE(document.is_discarded());
+
+    // Processes in report order, each with the vestage its section shows
+    // (on the name line, or after the warnings when there are some).
+    std::vector<std::pair<int64_t, int64_t>> textOrder;
+    const std::regex headerLine(R"(^.* \[(-?\d+)\]: (?:32|64)-bit)");
+    const std::regex vestageLine(R"(\tVestage: (\d+) B)");
+    std::istringstream lines(run.out);
+    for (std::string line; std::getline(lines, line);) {
+        std::smatch match;
+        if (std::regex_search(line, match, headerLine)) {
+            textOrder.emplace_back(std::stoll(match[1]), 0);
+        }
+        if (!textOrder.empty() && std::regex_search(line, match, vestageLine)) {
+            textOrder.back().second = std::stoll(match[1]);
+        }
+    }
+    std::vector<std::pair<int64_t, int64_t>> jsonOrder;
+    for (const auto &process : document.at("processes")) {
+        jsonOrder.emplace_back(process.at("pid").get<int64_t>(), process.at("vestage").get<int64_t>());
+    }
+    EXPECT_EQ(jsonOrder, textOrder);
+    ASSERT_FALSE(jsonOrder.empty());
+
+    const auto &total = document.at("summary").at("total");
+    EXPECT_EQ(document.at("total vestage").get<uint64_t>(),
+              total.at("dirty").get<uint64_t>());  // dirty already includes swapped
+    // The summary's TOTAL row is the last one of the report.
+    const size_t lastTotal = run.out.rfind("    TOTAL\n");
+    ASSERT_NE(lastTotal, std::string::npos);
+    const size_t rowStart = run.out.rfind('\n', lastTotal) + 1;
+    EXPECT_EQ(std::stoull(run.out.substr(rowStart)), total.at("dirty").get<uint64_t>());
 }
 
 }  // namespace
