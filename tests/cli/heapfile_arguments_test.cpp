@@ -5,8 +5,6 @@
 #include <gtest/gtest.h>
 
 #include <climits>
-#include <cstdio>
-#include <cstdlib>
 #include <filesystem>
 #include <set>
 #include <string>
@@ -18,29 +16,8 @@
 
 namespace {
 
+using vs::testing::CapturedStream;
 using vs::testing::ScratchFile;
-
-// Collects what the function writes to its error stream.
-class CapturedStream {
-public:
-    CapturedStream() : _stream(open_memstream(&_buffer, &_size)) {}
-    ~CapturedStream() {
-        if (_stream != nullptr) {
-            std::fclose(_stream);
-        }
-        std::free(_buffer);
-    }
-    FILE *stream() { return _stream; }
-    std::string text() {
-        std::fflush(_stream);
-        return std::string(_buffer, _size);
-    }
-
-private:
-    char *_buffer = nullptr;
-    size_t _size = 0;
-    FILE *_stream;
-};
 
 // Runs the body with the working directory set to `directory`.
 class WorkingDirectory {

@@ -19,30 +19,12 @@
 #include "cli/heapfile_arguments.h"
 #include "output/text_formatter.h"
 #include "targets/heapfile_process.h"
+#include "tests/targets/heapfile_test_support.h"
 #include "tests/targets/target_test_support.h"
 
 namespace {
 
 const std::string kFixtures = VESTAGE_TEST_DATA_DIR "/heapfiles/";
-
-class Captured {
-public:
-    Captured() : _stream(open_memstream(&_buffer, &_length)) {}
-    ~Captured() {
-        std::fclose(_stream);
-        std::free(_buffer);
-    }
-    std::FILE *stream() const { return _stream; }
-    std::string text() {
-        std::fflush(_stream);
-        return std::string(_buffer, _length);
-    }
-
-private:
-    char *_buffer = nullptr;
-    size_t _length = 0;
-    std::FILE *_stream;
-};
 
 struct GoldenCase {
     const char *report;  // stored as tests/data/heapfiles/REPORT.txt
@@ -58,7 +40,7 @@ protected:
         VSTargetMap targetMap;
         VSPidTable pidTable;
         vs::BreakdownModeState mode;
-        Captured errors;
+        vs::testing::CapturedStream errors;
         for (const std::string &file : c.heapfiles) {
             EXPECT_EQ(vs::loadHeapfileArgument(kFixtures + file, mode, targetMap, pidTable, errors.stream()),
                       std::nullopt);
@@ -74,7 +56,7 @@ protected:
         }
         VSVestage vestage(std::move(targets));
         vestage.gatherData();
-        Captured output;
+        vs::testing::CapturedStream output;
         auto text = std::make_unique<VSOutputFormatterText>(c.format, c.options);
         text->setOutput(output.stream());
         vestage.addOutputFormatter(std::move(text));

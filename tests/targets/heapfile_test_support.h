@@ -1,12 +1,13 @@
 #pragma once
 
-// Small heapfiles for the target tests: a snapshot built in code, written
-// to a file of its own that disappears with the test.
+// Small heapfiles for the tests: a snapshot built in code, written to a
+// file of its own that disappears with the test.
 
 #include <gtest/gtest.h>
 
 #include <atomic>
 #include <cstdio>
+#include <cstdlib>
 #include <filesystem>
 #include <string>
 #include <utility>
@@ -45,6 +46,28 @@ public:
 private:
     std::filesystem::path _directory;
     std::string _path;
+};
+
+// Collects what is written to a stdio stream.
+class CapturedStream {
+public:
+    CapturedStream() : _stream(open_memstream(&_buffer, &_length)) {}
+    ~CapturedStream() {
+        std::fclose(_stream);
+        std::free(_buffer);
+    }
+    CapturedStream(const CapturedStream &) = delete;
+    CapturedStream &operator=(const CapturedStream &) = delete;
+    std::FILE *stream() const { return _stream; }
+    std::string text() {
+        std::fflush(_stream);
+        return std::string(_buffer, _length);
+    }
+
+private:
+    char *_buffer = nullptr;
+    size_t _length = 0;
+    std::FILE *_stream;
 };
 
 // A snapshot of pid 4242 "worker" with page size 4096 and no shared region.
