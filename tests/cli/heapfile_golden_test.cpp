@@ -66,6 +66,11 @@ protected:
 };
 
 TEST_F(HeapfileGoldenTest, ReportsOfTheCheckedInHeapfiles) {
+    // The same reports as `vestage ARGS` in tests/data/heapfiles prints them:
+    //   linux-worker           -f bytes --swapped linux-worker.heap
+    //   linux-workers-sharing  linux-worker.heap linux-worker-peer.heap
+    //   arm64-shared-cache     -v -f bytes --swapped arm64-shared-cache.heap
+    //   armv7k-breakdown       -v -f bytes armv7k-breakdown.heap
     const std::vector<GoldenCase> cases = {
         {"linux-worker", {"linux-worker.heap"}, false, VSSummaryFormatBytes, VSOutputOptionSwapped},
         {"linux-workers-sharing", {"linux-worker.heap", "linux-worker-peer.heap"}, false, VSSummaryFormatFormatted,
