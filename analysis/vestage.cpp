@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdint>
 #include <cstdio>
 #include <cstring>
 #include <unordered_set>
@@ -95,7 +96,10 @@ void VSVestage::_addProcess(VSProcess &process) {
                 table = &_linkeditMemoryObjects;
                 break;
             default:
-                table = &_memoryObjects;
+                // The kernel's made-up object ids could meet the private keys
+                // of copy-on-write regions (a pid in the upper half), so its
+                // objects are keyed apart from every process's.
+                table = process.pid() == 0 ? &_kernelMemoryObjects : &_memoryObjects;
                 break;
             }
         }
@@ -120,7 +124,8 @@ void VSVestage::_addProcess(VSProcess &process) {
 }
 
 void VSVestage::calculateSizes() {
-    for (const MemoryObjectTable *table : {&_memoryObjects, &_sharedCache32MemoryObjects, &_sharedCache64MemoryObjects}) {
+    for (const MemoryObjectTable *table :
+         {&_memoryObjects, &_kernelMemoryObjects, &_sharedCache32MemoryObjects, &_sharedCache64MemoryObjects}) {
         for (const auto &entry : *table) {
             entry.second->calculateSizes();
         }
@@ -149,6 +154,7 @@ std::unique_ptr<vs::InterruptSource> VSVestage::installCancelHandler(std::functi
 bool VSVestage::breakDownPhysVestage() { return vs::readBreakDownPhysVestageSetting(); }
 
 void VSVestage::setBreakDownPhysVestage(bool enabled) {
+    vs::setProgramBreakDownFlag(enabled);
     const std::int32_t error = VSPlatform::current().sysctl_by_name_write(kBreakDownSetting, enabled ? 1 : 0);
     if (error != 0 && error != ENOENT) {
         reportSystemError("Unable to configure physical vestage data collection", error);
@@ -286,21 +292,41 @@ std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
     // Phase one: the group of every object, objects in the order first met.
     std::vector<std::pair<VSMemoryObject *, VSProcessGroup>> objectToProcesses;
     std::unordered_map<const VSMemoryObject *, std::size_t> indexOfObject;
+    // With distinct pids (every live run) a target that is already a member
+    // of a group was the last one added, since targets are visited one after
+    // another: no search through the members is needed.
+    std::unordered_set<std::int32_t> pids;
     for (const std::unique_ptr<VSProcess> &process : _processes) {
+        pids.insert(process->pid());
+    }
+    const bool distinctPids = pids.size() == _processes.size();
+    for (const std::unique_ptr<VSProcess> &process : _processes) {
+        std::size_t lastIndex = SIZE_MAX;
+        const VSMemoryObject *lastObject = nullptr;
         for (const std::unique_ptr<VSMemoryRegion> &region : process->memoryRegions()) {
             VSMemoryObject *object = region->memoryObject();
             if (object == nullptr) {
                 continue;
             }
-            auto [found, added] = indexOfObject.try_emplace(object, objectToProcesses.size());
-            if (added) {
-                objectToProcesses.emplace_back(object, VSProcessGroup{});
+            std::size_t index = lastIndex;
+            if (object != lastObject) {
+                auto [found, added] = indexOfObject.try_emplace(object, objectToProcesses.size());
+                if (added) {
+                    objectToProcesses.emplace_back(object, VSProcessGroup{});
+                }
+                index = found->second;
+                lastObject = object;
+                lastIndex = index;
             }
-            VSProcessGroup &group = objectToProcesses[found->second].second;
+            VSProcessGroup &group = objectToProcesses[index].second;
             // Members are distinct by pid; the first target with a pid stays.
-            const bool member = std::any_of(group.begin(), group.end(), [&](const VSProcess *p) {
-                return p->pid() == process->pid();
-            });
+            bool member;
+            if (distinctPids) {
+                member = !group.empty() && group.back() == process.get();
+            } else {
+                member = std::any_of(group.begin(), group.end(),
+                                     [&](const VSProcess *p) { return p->pid() == process->pid(); });
+            }
             if (!member) {
                 group.push_back(process.get());
             }
@@ -313,9 +339,12 @@ std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
     for (auto &[object, group] : objectToProcesses) {
         std::stable_sort(group.begin(), group.end(),
                          [](const VSProcess *a, const VSProcess *b) { return a->pid() < b->pid(); });
-        processGroupToObjects[group].insert(object);
-        for (const VSProcess *member : group) {
-            processToProcessGroups[member->asNumber()].insert(group);
+        auto [entry, newGroup] = processGroupToObjects.try_emplace(group);
+        entry->second.insert(object);
+        if (newGroup) {
+            for (const VSProcess *member : group) {
+                processToProcessGroups[member->asNumber()].insert(group);
+            }
         }
     }
 
@@ -327,8 +356,8 @@ std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
 
 void VSVestage::_releaseMemoryObjectsTo(VSVestageSharingData &sharing) {
     MemoryObjectList objects;
-    for (MemoryObjectTable *table : {&_memoryObjects, &_sharedCache64MemoryObjects, &_sharedCache32MemoryObjects,
-                                     &_textMemoryObjects, &_linkeditMemoryObjects}) {
+    for (MemoryObjectTable *table : {&_memoryObjects, &_kernelMemoryObjects, &_sharedCache64MemoryObjects,
+                                     &_sharedCache32MemoryObjects, &_textMemoryObjects, &_linkeditMemoryObjects}) {
         for (auto &entry : *table) {
             objects.push_back(std::move(entry.second));
         }
@@ -384,6 +413,12 @@ void VSVestage::printOutputVerbose(bool verbose, bool summarize) {
     std::vector<const VSProcess *> processesWithErrors;
     std::shared_ptr<const VSAuxDataDictionary> mergedAuxData;
     VSCategoryTotals totals;
+    struct GroupTable {
+        VSCategoryTable categories;
+        VSSortedCategoryKeys keys;
+        VSCategoryTotals totals;
+    };
+    std::unordered_map<const vs::MemoryObjectSet *, std::unique_ptr<GroupTable>> groupTables;
 
     for (const VSProcess *process : processes) {
         const bool hasErrors = !process->errors().empty();
@@ -425,14 +460,22 @@ void VSVestage::printOutputVerbose(bool verbose, bool summarize) {
         }
         for (const VSProcessGroup *group : groups) {
             const vs::MemoryObjectSet &objects = sharing->processGroupToObjects().at(*group);
-            VSCategoryTable categories =
-                _summarizedCategoriesForCategories(_categoriesForObjects(objects.items()), summarize, totals);
-            const VSSortedCategoryKeys keys = _sortedKeysForCategories(categories);
+            // A shared group's table is the same for every member that
+            // prints it: build it once.
+            std::unique_ptr<GroupTable> privateTable;
+            std::unique_ptr<GroupTable> &table = group->size() == 1 ? privateTable : groupTables[&objects];
+            if (!table) {
+                table = std::make_unique<GroupTable>();
+                table->categories = _summarizedCategoriesForCategories(_categoriesForObjects(objects.items()),
+                                                                       summarize, table->totals);
+                table->keys = _sortedKeysForCategories(table->categories);
+            }
             for (const std::unique_ptr<VSOutputFormatter> &formatter : _outputFormatters) {
                 if (group->size() == 1) {
-                    formatter->printProcessCategories(categories, keys, totals);
+                    formatter->printProcessCategories(table->categories, table->keys, table->totals);
                 } else if (formatter->implementsOperation(VSOptionalFormatterOperation::printSharedCategories)) {
-                    formatter->printSharedCategories(categories, keys, *group, *process, totals);
+                    formatter->printSharedCategories(table->categories, table->keys, *group, *process,
+                                                     table->totals);
                 }
             }
         }

@@ -97,6 +97,7 @@ public:
     const MemoryObjectTable &textMemoryObjects() const { return _textMemoryObjects; }
     const MemoryObjectTable &linkeditMemoryObjects() const { return _linkeditMemoryObjects; }
     const MemoryObjectList &uniqueMemoryObjects() const { return _uniqueMemoryObjects; }
+    const MemoryObjectTable &kernelMemoryObjects() const { return _kernelMemoryObjects; }
 
     // ---- steps of the analysis, exposed for the report's tests -------------
     // Files one target's regions into the collections.
@@ -142,6 +143,7 @@ private:
     MemoryObjectTable _textMemoryObjects;
     MemoryObjectTable _linkeditMemoryObjects;
     MemoryObjectList _uniqueMemoryObjects;
+    MemoryObjectTable _kernelMemoryObjects;  // ordinary regions of the kernel target (pid 0)
     std::vector<std::unique_ptr<VSOutputFormatter>> _outputFormatters;
     std::atomic<bool> _earlyExit{false};
     unsigned _gatherWidth = 0;

@@ -7,8 +7,10 @@
 #include <utility>
 
 #include "analysis/vestage.h"
+#include "cli/heapfile_arguments.h"
 #include "output/json_formatter.h"
 #include "output/text_formatter.h"
+#include "targets/corpse_process.h"
 #include "targets/platform/linux/linux_platform.h"
 #include "targets/process.h"
 
@@ -16,30 +18,8 @@ namespace vs {
 
 namespace {
 
-// State the heapfile arguments share with the rest of the sequence: the
-// breakdown mode is switched for the whole run, so every heapfile and
-// --physVestage must agree on it.
-struct BreakDownMode {
-    bool enabled = false;
-    bool fixed = false;
-};
-
 std::vector<std::string> asVector(const std::set<std::string> &descriptions) {
     return {descriptions.begin(), descriptions.end()};
-}
-
-// A bare argument naming an existing file: a heapfile, or else one more
-// process description. Returns an exit status when the run must end.
-std::optional<int> takeExistingFileArgument(const std::string &argument, VSRunOptions &options) {
-    std::optional<VSPidTable> resolved = VSProcess::pidsForStringDescriptions({argument});
-    if (resolved && !resolved->empty()) {
-        for (auto &[pid, name] : *resolved) {
-            options.pidTable[pid] = name;
-        }
-        return std::nullopt;
-    }
-    std::fprintf(stderr, "Error opening heapfile %s: %s\n", argument.c_str(), "heapfiles are not supported yet");
-    return 1;
 }
 
 // The corpse checks: a name, a positive pid and a usable corpse port.
@@ -64,7 +44,7 @@ std::optional<int> checkCorpseArguments(const VSRunOptions &options, uint32_t &c
 
 int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArguments) {
     VSTargetMap targetMap;
-    BreakDownMode breakDown{options.breakDownRequested, options.breakDownRequested};
+    BreakdownModeState breakDown{options.breakDownRequested, options.breakDownRequested};
 
     for (const std::string &argument : bareArguments) {
         std::error_code error;
@@ -72,7 +52,7 @@ int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArgum
             options.processDescriptions.insert(argument);
             continue;
         }
-        if (std::optional<int> status = takeExistingFileArgument(argument, options)) {
+        if (std::optional<int> status = loadHeapfileArgument(argument, breakDown, targetMap, options.pidTable)) {
             return *status;
         }
     }
@@ -98,7 +78,7 @@ int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArgum
         }
     }
 
-    if (breakDown.enabled) {
+    if (breakDown.breakDown) {
         VSVestage::setBreakDownPhysVestage(true);
     }
 
@@ -156,6 +136,14 @@ int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArgum
             } else {
                 std::fprintf(stderr, "Unable to analyze process with pid %ld (try as root?)\n", static_cast<long>(pid));
             }
+        }
+    }
+
+    if (options.corpseMode) {
+        const int32_t corpsePid = static_cast<int32_t>(options.corpsePid);
+        if (std::unique_ptr<VSProcess> corpse = VSCorpseProcess::processWithCorpse(
+                corpsePort, corpsePid, *options.corpseName, options.corpseDirtyFlags, options.corpseProcFlags)) {
+            targetMap[corpsePid] = std::move(corpse);
         }
     }
 

@@ -178,13 +178,19 @@ private:
         }
         const auto found = _object.find(key);
         if (found == _object.end()) {
-            fail(vs::kHeapfileErrorMissingKey, "missing key \"" + std::string(key) + "\"");
+            fail(vs::kHeapfileErrorMissingKey, "missing key " + _name(key));
             return nullptr;
         }
         return &*found;
     }
 
-    static std::string _name(const char *key) { return "\"" + std::string(key) + "\""; }
+    static std::string _name(const char *key) {
+        // Appending, not operator+ on a literal: g++ 12 at -O3 warns falsely
+        // about overlapping copies there.
+        std::string quoted(1, '"');
+        quoted.append(key).push_back('"');
+        return quoted;
+    }
 
     static std::string _describe(const json &value) {
         std::string text = value.dump();

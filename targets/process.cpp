@@ -1,12 +1,15 @@
 #include "targets/process.h"
 
+#include <atomic>
 #include <cctype>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <mutex>
+#include <memory>
 #include <new>
+#include <span>
 #include <string_view>
 #include <unordered_set>
 
@@ -215,12 +218,22 @@ std::string VSProcess::_nameForBsdInfo(const VSBsdInfo &info) {
     if (platform.argument_area_max_size(areaSize) != 0 || areaSize <= 0) {
         return _nameForBsdInfoCommName(info);
     }
-    std::vector<char> area;
-    try {
-        area.resize(static_cast<size_t>(areaSize));
-    } catch (const std::bad_alloc &) {
-        return _nameForBsdInfoCommName(info);
+    // The area is as large as the longest argument list (megabytes), while
+    // only its first bytes are ever stored for most processes: one buffer per
+    // thread, never cleared, so that its untouched pages stay unallocated.
+    thread_local std::unique_ptr<char[]> buffer;
+    thread_local size_t bufferSize = 0;
+    if (bufferSize < static_cast<size_t>(areaSize)) {
+        buffer.reset();
+        bufferSize = 0;
+        try {
+            buffer = std::make_unique_for_overwrite<char[]>(static_cast<size_t>(areaSize));
+        } catch (const std::bad_alloc &) {
+            return _nameForBsdInfoCommName(info);
+        }
+        bufferSize = static_cast<size_t>(areaSize);
     }
+    const std::span<char> area(buffer.get(), static_cast<size_t>(areaSize));
     size_t length = 0;
     if (platform.process_argument_area(static_cast<int32_t>(info.pid), area, length) != 0) {
         return _nameForBsdInfoCommName(info);
@@ -349,6 +362,14 @@ VSTargetMap VSProcess::removeIdleExitCleanProcessesFrom(VSTargetMap processes) {
 
 // ---- the breakdown switch ---------------------------------------------------------
 
+namespace {
+// Linux has no kernel setting for the breakdown, so the program keeps the
+// switch itself; a kernel that has the setting still has the last word.
+std::atomic<bool> programBreakDownFlag{false};
+}  // namespace
+
+void vs::setProgramBreakDownFlag(bool enabled) { programBreakDownFlag.store(enabled); }
+
 bool vs::readBreakDownPhysVestageSetting() {
     int32_t value = 0;
     const int32_t error = VSPlatform::current().sysctl_by_name_read("vm.self_region_vestage", value);
@@ -356,8 +377,9 @@ bool vs::readBreakDownPhysVestageSetting() {
         if (error != ENOENT) {
             std::fprintf(stderr, "Unable to retrieve status of physical vestage data collection: %s\n",
                          std::strerror(error));
+            return false;
         }
-        return false;
+        return programBreakDownFlag.load();
     }
     return value != 0;
 }

@@ -194,5 +194,7 @@ namespace vs {
 // collection: <reason>" to standard error and reads as false; a missing
 // setting reads as false. The driver's class-wide switch answers with this.
 bool readBreakDownPhysVestageSetting();
+// The switch as this program keeps it where the kernel has no such setting.
+void setProgramBreakDownFlag(bool enabled);
 
 }  // namespace vs

@@ -84,6 +84,18 @@ TEST(Merging, RegionsBecomeMemoryObjectsByKey) {
     }
 }
 
+// A process in a pid namespace can have pid 2; the private key of its dirty
+// copy-on-write region then equals a kernel zone's made-up object id.
+TEST(Merging, KernelObjectsNeverMergeWithProcessObjects) {
+    ReportRun run;
+    run.process(0, "kernel").region({.objectId = 0x200000005, .dirty = 1});
+    run.process(2, "worker").region({.objectId = 5, .dirty = 1, .shareMode = vs::kShareModeCopyOnWrite});
+    const VSVestage &v = run.gather();
+    EXPECT_NE(v.processes()[0]->memoryRegions()[0]->memoryObject(), v.processes()[1]->memoryRegions()[0]->memoryObject());
+    EXPECT_EQ(v.kernelMemoryObjects().size(), 1u);
+    EXPECT_EQ(v.memoryObjects().size(), 1u);
+}
+
 TEST(Vestage, ChargesDistinctObjectsAndOrdersTargets) {
     ReportRun run;
     std::vector<std::int32_t> started;
