@@ -86,12 +86,13 @@ TEST(LinuxRegionRecords, RecordFieldsFromSmaps) {
         {"executable anonymous memory is JIT code", "1000-3000 r-xp 00000000 00:00 0 \nRss: 8 kB\n"
          "Private_Dirty: 8 kB\nVmFlags: rd ex mr mw me\n",
          {}, vs::kTagJitCode, vs::kShareModePrivate, 0, vs::kInheritCopy, 5, 7, 0, 2, 2, 0, 0, 0},
-        {"vdso", "1000-3000 r-xp 00000000 00:00 0 [vdso]\nRss: 8 kB\nVmFlags: rd ex mr mw me de\n", {},
-         vs::kTagVdso, vs::kShareModePrivate, 0, vs::kInheritCopy, 5, 7, 0, 2, 0, 0, 0, 0},
+        {"vdso is one object shared by every process", "1000-3000 r-xp 00000000 00:00 0 [vdso]\nRss: 8 kB\n"
+         "Shared_Clean: 8 kB\nVmFlags: rd ex mr mw me de\n", {},
+         vs::kTagVdso, vs::kShareModeShared, 0, vs::kInheritCopy, 5, 7, 0, 2, 0, 0, 0, 0},
         {"vvar", "1000-3000 r--p 00000000 00:00 0 [vvar]\nVmFlags: rd mr pf io de dd\n", {}, vs::kTagVvar,
-         vs::kShareModeEmpty, 0, vs::kInheritCopy, 1, 1, 0, 0, 0, 0, 0, 0},
+         vs::kShareModeShared, 0, vs::kInheritCopy, 1, 1, 0, 0, 0, 0, 0, 0},
         {"vsyscall", "1000-3000 --xp 00000000 00:00 0 [vsyscall]\nVmFlags: ex\n", {}, vs::kTagVsyscall,
-         vs::kShareModeEmpty, 0, vs::kInheritCopy, 4, 0, 0, 0, 0, 0, 0, 0},
+         vs::kShareModeShared, 0, vs::kInheritCopy, 4, 0, 0, 0, 0, 0, 0, 0},
         {"not inherited by a child", "1000-3000 rw-p 00000000 00:00 0 \nVmFlags: rd wr mr mw me dc\n", {}, 0,
          vs::kShareModeEmpty, 0, vs::kInheritNone, 3, 7, 0, 0, 0, 0, 0, 0},
         {"a file gap of a library is no guard", "1000-3000 ---p 001d3000 fe:00 99 /usr/lib/x.so\nVmFlags: mr mw me\n",

@@ -135,7 +135,9 @@ VSRegionInfo regionInfoFor(const SmapsRegion &region, MappingKind kind, uint32_t
     info.reusablePages = pages(region.lazyFree, pageSize);
     info.referenceCount = 1;
     info.externalPager = kind == MappingKind::File ? 1 : 0;
-    if (region.shared) {
+    // The kernel's special mappings are the same pages in every process, so
+    // they are one shared object rather than a private copy per process.
+    if (region.shared || kind == MappingKind::Special) {
         info.shareMode = kShareModeShared;
     } else if (region.rss + region.swap == 0) {
         info.shareMode = kShareModeEmpty;
