@@ -602,10 +602,14 @@ TEST_F(LinuxProcessTest, CrashHelperFindsThePidfdOnDescriptorThree) {
 TEST_F(LinuxProcessTest, SmapsLargerThanTheFirstReadIsReadWhole) {
     // 600 mappings print far more smaps text than the first read takes;
     // alternating protections keep the kernel from merging them.
+    // An inaccessible page on either side keeps the ends from merging with
+    // whatever the test process happens to have mapped next to them.
     constexpr size_t kMappings = 600;
-    char *base = static_cast<char *>(
-        mmap(nullptr, kMappings * kPage, PROT_READ, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
-    ASSERT_NE(base, MAP_FAILED);
+    char *outer = static_cast<char *>(
+        mmap(nullptr, (kMappings + 2) * kPage, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
+    ASSERT_NE(outer, MAP_FAILED);
+    char *base = outer + kPage;
+    ASSERT_EQ(mprotect(base, kMappings * kPage, PROT_READ), 0);
     for (size_t i = 0; i < kMappings; i += 2) {
         ASSERT_EQ(mprotect(base + i * kPage, kPage, PROT_READ | PROT_WRITE), 0);
         base[i * kPage] = 1;
@@ -624,7 +628,7 @@ TEST_F(LinuxProcessTest, SmapsLargerThanTheFirstReadIsReadWhole) {
     }
     EXPECT_EQ(found, kMappings);
     platform.release_task_handle(task);
-    munmap(base, kMappings * kPage);
+    munmap(outer, (kMappings + 2) * kPage);
 }
 
 TEST_F(LinuxProcessTest, KernelMemoryAndSettings) {
