@@ -101,7 +101,7 @@ TEST(Image, SetNameClassifiesTheSegment) {
         {{""}, VSSegmentUnknown},
         {{std::nullopt}, VSSegmentUnknown},
         // Unrecognised names keep the previous kind.
-        {{"__TEXT", "__OBJC"}, VSSegmentText},
+        {{"__TEXT", "__OBJECTS"}, VSSegmentText},
         {{"__TEXT", std::nullopt}, VSSegmentText},
         {{"__TEXT", "__DATA"}, VSSegmentData},
         {{"__DATA", "__LINKEDIT"}, VSSegmentLinkedit},

@@ -42,17 +42,17 @@ std::ostream &operator<<(std::ostream &out, const NodeSpec &n) {
                << n.sizes.wired << "}";
 }
 
-std::unique_ptr<VSMemoryRegion> makeRegion(const RegionSpec &spec) {
+std::unique_ptr<VSMemoryRegion> makeRegion(const RegionSpec &shape) {
     auto region = std::make_unique<VSMemoryRegion>();
-    region->setOffset(spec.offset);
-    region->setSize(spec.size);
-    region->setStart(0x100000000ull + spec.offset);
-    region->setDirtySize(spec.sizes.dirty);
-    region->setCleanNonSpecSize(spec.sizes.clean);
-    region->setSwappedSize(spec.sizes.swapped);
-    region->setReclaimableSize(spec.sizes.reclaimable);
-    region->setWiredSize(spec.sizes.wired);
-    region->setObject_id(spec.objectId);
+    region->setOffset(shape.offset);
+    region->setSize(shape.size);
+    region->setStart(0x100000000ull + shape.offset);
+    region->setDirtySize(shape.sizes.dirty);
+    region->setCleanNonSpecSize(shape.sizes.clean);
+    region->setSwappedSize(shape.sizes.swapped);
+    region->setReclaimableSize(shape.sizes.reclaimable);
+    region->setWiredSize(shape.sizes.wired);
+    region->setObject_id(shape.objectId);
     return region;
 }
 
@@ -190,8 +190,8 @@ TEST(MemoryObject, RangeListMerges) {
         SCOPED_TRACE(c.what);
         std::vector<std::unique_ptr<VSMemoryRegion>> owned;
         VSMemoryObject object;
-        for (const RegionSpec &spec : c.regions) {
-            owned.push_back(makeRegion(spec));
+        for (const RegionSpec &shape : c.regions) {
+            owned.push_back(makeRegion(shape));
             object.addRegion(owned.back().get(), c.pageSize);
         }
         object.calculateSizes();

@@ -159,8 +159,8 @@ TEST(Sharing, ProcessGroups) {
         ReportRun run;
         for (const Target &target : c.targets) {
             PreparedProcess &process = run.process(target.pid, "p");
-            for (const RegionSpec &spec : target.regions) {
-                process.region(spec);
+            for (const RegionSpec &shape : target.regions) {
+                process.region(shape);
             }
         }
         const VSVestage &vestage = run.gather();
@@ -201,9 +201,9 @@ TEST(Categories, FoldingIntoOther) {
     PreparedProcess &process = run.process(1, "p");
     std::uint64_t objectId = 100;
     for (const Entry &entry : entries) {
-        RegionSpec spec = entry.region;
-        spec.objectId = objectId++;
-        process.region(spec);
+        RegionSpec shape = entry.region;
+        shape.objectId = objectId++;
+        process.region(shape);
     }
     // A second region of a folded object: "Other" counts the object once.
     process.region({.name = "mapped file", .objectId = 104, .clean = 4 * MiB});

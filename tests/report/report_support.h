@@ -46,22 +46,22 @@ public:
         setIs64bit(is64);
     }
 
-    PreparedProcess &region(const RegionSpec &spec) {
+    PreparedProcess &region(const RegionSpec &shape) {
         auto r = std::make_unique<VSMemoryRegion>();
-        r->setName(spec.name);
-        r->setObject_id(spec.objectId);
-        r->setStart(spec.start != 0 ? spec.start : 16 * MiB * (_prepared.size() + 1));
+        r->setName(shape.name);
+        r->setObject_id(shape.objectId);
+        r->setStart(shape.start != 0 ? shape.start : 16 * MiB * (_prepared.size() + 1));
         r->setSize(16 * MiB);
-        r->setDirtySize(spec.dirty);
-        r->setSwappedSize(spec.swapped);
-        r->setCleanNonSpecSize(spec.clean);
-        r->setReclaimableSize(spec.reclaimable);
-        r->setWiredSize(spec.wired);
-        r->setSegment(spec.segment);
-        r->setShare_mode(spec.shareMode);
-        r->setOffset(spec.offset);
-        r->setInSharedCache(spec.inSharedCache);
-        r->setPurgeableNonVolatile(spec.purgeableNonVolatile);
+        r->setDirtySize(shape.dirty);
+        r->setSwappedSize(shape.swapped);
+        r->setCleanNonSpecSize(shape.clean);
+        r->setReclaimableSize(shape.reclaimable);
+        r->setWiredSize(shape.wired);
+        r->setSegment(shape.segment);
+        r->setShare_mode(shape.shareMode);
+        r->setOffset(shape.offset);
+        r->setInSharedCache(shape.inSharedCache);
+        r->setPurgeableNonVolatile(shape.purgeableNonVolatile);
         _prepared.push_back(std::move(r));
         return *this;
     }

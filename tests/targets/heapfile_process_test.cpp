@@ -95,7 +95,7 @@ TEST_F(HeapfileProcessTest, SegmentTypesBecomeImagesThatNameTheirOwnRegions) {
         region({0x14000, 0x3000, "mapped file", "/data/table", true}),
         region({0x17000, 0x1000, "shared memory", "/memfd:pool", false}),
         region({0x18000, 0x1000, "__LINKEDIT", "/bin/app", true}),
-        region({0x19000, 0x1000, "__OBJC", "/bin/app", true}),
+        region({0x19000, 0x1000, "__OBJECTS", "/bin/app", true}),
     }));
     ASSERT_NE(process, nullptr);
 

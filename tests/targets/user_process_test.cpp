@@ -202,7 +202,7 @@ TEST_F(UserProcessTest, ImagesAreSortedAndHeadersCountAsText) {
     p.image("/test/lib/b.so").segment("__DATA_CONST rest", 0x30000, 0x1000).segment("__LINKEDIT", 0x40000, 0x1000);
     p.image("/test/lib/a.so")
         .segment(std::string(VSPlatform::image_header_segment_name), 0x10000, 0x1000)
-        .segment("__OBJC", 0x20000, 0x1000)
+        .segment("__OBJECTS", 0x20000, 0x1000)
         .segment("__DATA", 0x28000, 0);  // covers nothing
     auto process = gathered();
     ASSERT_NE(process, nullptr);
@@ -220,7 +220,7 @@ TEST_F(UserProcessTest, ImagesAreSortedAndHeadersCountAsText) {
     }
     const std::vector<Seen> expected = {
         {0x10000, "__TEXT", VSSegmentText, "/test/lib/a.so"},
-        {0x20000, "__OBJC", VSSegmentUnknown, "/test/lib/a.so"},
+        {0x20000, "__OBJECTS", VSSegmentUnknown, "/test/lib/a.so"},
         {0x30000, "__DATA_CONST", VSSegmentData, "/test/lib/b.so"},
         {0x40000, "__LINKEDIT", VSSegmentLinkedit, "/test/lib/b.so"},
     };
