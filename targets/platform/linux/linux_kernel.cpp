@@ -13,6 +13,7 @@
 #include "targets/platform/linux/proc_text.h"
 
 #include <algorithm>
+#include <optional>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -45,6 +46,15 @@ constexpr MeminfoSite kMeminfoSites[] = {
     {"Zswap", 15},        // compressed pages
     {"Mlocked", 24},      // user pages locked in memory
 };
+
+constexpr uint64_t kKernelStackTag = 8;
+
+// Where vmalloc'd thread stacks come from; depending on inlining the kernel
+// names one of these as the caller.
+bool isThreadStackAllocator(std::string_view symbol) {
+    return symbol == "alloc_thread_stack_node" || symbol == "dup_task_struct" || symbol == "copy_process" ||
+           symbol == "kernel_clone";
+}
 
 // meminfo totals reported as counters, with their counter index.
 struct MeminfoCounter {
@@ -147,8 +157,12 @@ VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneNam
     if (error != 0) {
         return error;
     }
+    std::optional<size_t> kernelStackSite;
     for (const MeminfoSite &site : kMeminfoSites) {
         if (auto bytes = vs::statusBytes(text, site.name)) {
+            if (site.tag == kKernelStackTag) {
+                kernelStackSite = arrays->siteInfos.size();
+            }
             VSKernelSiteInfo info;
             info.flags = vs::kSiteTypeTag | vs::kSiteFlagWired;
             info.site = site.tag;
@@ -189,6 +203,7 @@ VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneNam
             addressOf.try_emplace(symbol.name, symbol.address);
         }
         uint64_t unresolved = 0;
+        uint64_t stackBytes = 0;
         for (const vs::VmallocCaller &caller : callers) {
             VSKernelSiteInfo info;
             info.flags = vs::kSiteTypeCodeAddress | vs::kSiteFlagWired;
@@ -196,6 +211,9 @@ VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneNam
             std::string_view symbol;
             uint64_t offset = 0;
             vs::splitCaller(caller.caller, symbol, offset);
+            if (isThreadStackAllocator(symbol)) {
+                stackBytes += info.size;
+            }
             auto it = addressOf.find(symbol);
             if (it != addressOf.end()) {
                 info.site = it->second + offset;
@@ -206,6 +224,12 @@ VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneNam
                 setName(info.name, symbol);
             }
             arrays->siteInfos.push_back(info);
+        }
+        // With virtually mapped stacks the same pages are also counted in
+        // KernelStack: count them once, under the code that allocated them.
+        if (kernelStackSite) {
+            uint64_t &size = arrays->siteInfos[*kernelStackSite].size;
+            size -= std::min(size, stackBytes);
         }
     }
 
