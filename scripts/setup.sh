@@ -15,7 +15,6 @@ done
 [ ${#missing[@]} -eq 0 ] && exit 0
 
 if [ "$(id -u)" -ne 0 ]; then
-    echo "Missing packages. Run as root:" >&2
     echo "apt-get update && apt-get install -y ${missing[*]}" >&2
     exit 1
 fi
