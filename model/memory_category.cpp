@@ -1,5 +1,6 @@
 #include "model/memory_category.h"
 
+#include <algorithm>
 #include <utility>
 
 #include "model/assert.h"
@@ -17,13 +18,36 @@ void VSMemoryCategory::addMemoryObject(VSMemoryObject *object) {
     _totalCleanSize += object->totalCleanSize();
     _totalReclaimableSize += object->totalReclaimableSize();
     _totalWiredSize += object->totalWiredSize();
-    _memoryRegions.unionWith(object->memoryRegions());
+
+    const vs::RegionSet &regions = object->memoryRegions();
+    if (_regionsDisjoint) {
+        const bool ownsAll = std::all_of(regions.begin(), regions.end(),
+                                         [object](const VSMemoryRegion *r) { return r->memoryObject() == object; });
+        if (ownsAll) {
+            if (_firstRegion == nullptr && !regions.empty()) {
+                _firstRegion = *regions.begin();
+            }
+            _regionCount += static_cast<std::int32_t>(regions.size());
+            return;
+        }
+        // From here on regions are counted through the set, filled in the
+        // order the objects were added.
+        _regionsDisjoint = false;
+        for (VSMemoryObject *earlier : _memoryObjects) {
+            if (earlier != object) {
+                _memoryRegions.unionWith(earlier->memoryRegions());
+            }
+        }
+    }
+    _memoryRegions.unionWith(regions);
 }
 
 std::int32_t VSMemoryCategory::totalRegions() const {
-    return static_cast<std::int32_t>(_memoryRegions.size());
+    return _regionsDisjoint ? _regionCount : static_cast<std::int32_t>(_memoryRegions.size());
 }
 
 bool VSMemoryCategory::purgeableNonVolatile() const {
-    return !_memoryRegions.empty() && (*_memoryRegions.begin())->purgeableNonVolatile();
+    const VSMemoryRegion *first =
+        _regionsDisjoint ? _firstRegion : (_memoryRegions.empty() ? nullptr : *_memoryRegions.begin());
+    return first != nullptr && first->purgeableNonVolatile();
 }

@@ -50,5 +50,13 @@ private:
     std::uint64_t _totalReclaimableSize = 0;
     std::uint64_t _totalWiredSize = 0;
     VSSegmentKind _segment = VSSegmentUnknown;
+    // The union of the added objects' regions. While every added object's
+    // regions point back to that object, no region can be reached through
+    // two objects, so a count and the first region tell all that is asked;
+    // the set is only built once an object breaks that (shared report
+    // tables hold objects with hundreds of regions, built for every member).
+    std::int32_t _regionCount = 0;
+    const VSMemoryRegion *_firstRegion = nullptr;
+    bool _regionsDisjoint = true;
     vs::RegionSet _memoryRegions;
 };

@@ -43,6 +43,14 @@ struct World {
         objects.push_back(std::move(o));
         return objects.back().get();
     }
+
+    // Points the object's regions back at it, as the driver does after merging.
+    VSMemoryObject *filed(VSMemoryObject *o) {
+        for (VSMemoryRegion *r : o->memoryRegions()) {
+            r->setMemoryObject(o);
+        }
+        return o;
+    }
 };
 
 struct Expected {
@@ -99,6 +107,29 @@ TEST(MemoryCategory, SumsDistinctObjectsAndRegions) {
              return std::vector<VSMemoryObject *>{a, b};
          },
          {0x8000, 0, 0x4000, 0x4000, 0x2000, 2, 2, false}},
+        {"objects filed by the driver: regions counted per object",
+         [](World &w) {
+             VSMemoryObject *a = w.filed(w.object({w.region(0, 0x4000, 0), w.region(P * 2, 0, 0)}));
+             VSMemoryObject *b = w.filed(w.object({w.region(0, 0x1000, 0, 2, true)}));
+             return std::vector<VSMemoryObject *>{a, b, a};
+         },
+         {0x5000, 0, 0x7000, 0x2800, 0x1400, 3, 2, false}},
+        {"a filed region reached again through a later object counts once",
+         [](World &w) {
+             VSMemoryRegion *shared = w.region(0, 0x4000, 0);
+             VSMemoryObject *a = w.filed(w.object({shared, w.region(P * 2, 0, 0)}));
+             VSMemoryObject *b = w.object({w.region(P * 4, 0, 0), shared});
+             VSMemoryObject *c = w.filed(w.object({w.region(0, 0, 0, 3)}));
+             return std::vector<VSMemoryObject *>{a, b, c};
+         },
+         {0x8000, 0, 0xC000, 0x4000, 0x2000, 4, 3, false}},
+        {"purgeable flag taken from the first region of a filed object",
+         [](World &w) {
+             VSMemoryObject *none = w.filed(w.object({}));
+             VSMemoryObject *o = w.filed(w.object({w.region(0, 0x4000, 0, 1, true), w.region(P, 0, 0)}));
+             return std::vector<VSMemoryObject *>{none, o};
+         },
+         {0x4000, 0, 0x4000, 0x2000, 0x1000, 2, 2, true}},
         {"purgeable flag taken from the regions",
          [](World &w) {
              VSMemoryObject *o = w.object({w.region(0, 0x4000, 0, 1, true)});
