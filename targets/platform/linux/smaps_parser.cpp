@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <array>
+#include <cstring>
 
 namespace vs {
 
@@ -28,6 +29,13 @@ struct LineCursor {
 
     bool atEnd() const { return p >= end; }
     void skipBlanks() {
+        // The kernel pads columns with runs of blanks: step over eight at a
+        // time while it can.
+        constexpr uint64_t kEightBlanks = 0x2020202020202020ull;
+        uint64_t word;
+        while (end - p >= 8 && (std::memcpy(&word, p, 8), word == kEightBlanks)) {
+            p += 8;
+        }
         while (p < end && (*p == ' ' || *p == '\t')) {
             ++p;
         }
@@ -96,17 +104,12 @@ bool parseHeader(LineCursor c, SmapsRegion &r) {
     return r.end >= r.start;
 }
 
-// "Name:   123 kB" -> 123 * 1024. The caller has matched the name already.
+// "Name:   123 kB" -> 123 * 1024. The cursor stands after the colon.
 uint64_t kilobytes(LineCursor c) {
     c.skipBlanks();
     uint64_t value = 0;
     c.decimal(value);
     return value * 1024;
-}
-
-bool nameIs(std::string_view line, std::string_view name) {
-    return line.size() > name.size() && line.compare(0, name.size(), name) == 0 &&
-           line[name.size()] == ':';
 }
 
 void parseVmFlags(LineCursor c, SmapsRegion &r) {
@@ -128,49 +131,50 @@ void parseVmFlags(LineCursor c, SmapsRegion &r) {
     r.hasVmFlags = true;
 }
 
-void parseField(std::string_view line, LineCursor c, SmapsRegion &r) {
-    // Dispatch on the first letter, then compare the few names it can be.
+// True when the line starts with `name` (which ends in its colon).
+template <size_t N>
+bool hasName(const char *line, const char *lineEnd, const char (&name)[N]) {
+    constexpr size_t length = N - 1;
+    return static_cast<size_t>(lineEnd - line) >= length && std::memcmp(line, name, length) == 0;
+}
+
+// One "Name: value" line. The first letter picks the few names it can be;
+// every process prints about twenty-five of these per mapping, so this is
+// the parser's inner loop.
+void parseField(const char *line, const char *lineEnd, SmapsRegion &r) {
+    auto value = [&](size_t nameLength) { return kilobytes(LineCursor{line + nameLength, lineEnd}); };
     switch (line[0]) {
     case 'R':
-        if (nameIs(line, "Rss")) {
-            c.p += 4;
-            r.rss = kilobytes(c);
+        if (hasName(line, lineEnd, "Rss:")) {
+            r.rss = value(4);
         }
         break;
     case 'S':
-        if (nameIs(line, "Shared_Clean")) {
-            c.p += 13;
-            r.sharedClean = kilobytes(c);
-        } else if (nameIs(line, "Shared_Dirty")) {
-            c.p += 13;
-            r.sharedDirty = kilobytes(c);
-        } else if (nameIs(line, "Swap")) {
-            c.p += 5;
-            r.swap = kilobytes(c);
+        if (hasName(line, lineEnd, "Shared_Clean:")) {
+            r.sharedClean = value(13);
+        } else if (hasName(line, lineEnd, "Shared_Dirty:")) {
+            r.sharedDirty = value(13);
+        } else if (hasName(line, lineEnd, "Swap:")) {
+            r.swap = value(5);
         }
         break;
     case 'P':
-        if (nameIs(line, "Private_Clean")) {
-            c.p += 14;
-            r.privateClean = kilobytes(c);
-        } else if (nameIs(line, "Private_Dirty")) {
-            c.p += 14;
-            r.privateDirty = kilobytes(c);
+        if (hasName(line, lineEnd, "Private_Clean:")) {
+            r.privateClean = value(14);
+        } else if (hasName(line, lineEnd, "Private_Dirty:")) {
+            r.privateDirty = value(14);
         }
         break;
     case 'L':
-        if (nameIs(line, "LazyFree")) {
-            c.p += 9;
-            r.lazyFree = kilobytes(c);
-        } else if (nameIs(line, "Locked")) {
-            c.p += 7;
-            r.locked = kilobytes(c);
+        if (hasName(line, lineEnd, "LazyFree:")) {
+            r.lazyFree = value(9);
+        } else if (hasName(line, lineEnd, "Locked:")) {
+            r.locked = value(7);
         }
         break;
     case 'V':
-        if (nameIs(line, "VmFlags")) {
-            c.p += 8;
-            parseVmFlags(c, r);
+        if (hasName(line, lineEnd, "VmFlags:")) {
+            parseVmFlags(LineCursor{line + 8, lineEnd}, r);
         }
         break;
     default:
@@ -243,29 +247,27 @@ uint64_t vmFlagBit(char first, char second) {
 size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out) {
     const size_t before = out.size();
     bool inRegion = false;
-    size_t pos = 0;
-    while (pos < text.size()) {
-        const size_t newline = text.find('\n', pos);
-        if (newline == std::string_view::npos) {
+    const char *p = text.data();
+    const char *const end = p + text.size();
+    while (p < end) {
+        const char *newline = static_cast<const char *>(std::memchr(p, '\n', static_cast<size_t>(end - p)));
+        if (newline == nullptr) {
             break; // cut short: the last line is incomplete
         }
-        const std::string_view line = text.substr(pos, newline - pos);
-        pos = newline + 1;
-        if (line.empty()) {
+        const char *line = p;
+        p = newline + 1;
+        if (line == newline) {
             continue;
         }
-        LineCursor cursor{line.data(), line.data() + line.size()};
-        const char first = line[0];
-        if (hexValue(first) >= 0 && !(first >= 'A' && first <= 'F')) {
-            SmapsRegion region;
-            if (parseHeader(cursor, region)) {
-                out.push_back(std::move(region));
-                inRegion = true;
-            } else {
-                inRegion = false;
+        const char first = *line;
+        if ((first >= '0' && first <= '9') || (first >= 'a' && first <= 'f')) {
+            SmapsRegion &region = out.emplace_back();
+            inRegion = parseHeader(LineCursor{line, newline}, region);
+            if (!inRegion) {
+                out.pop_back();
             }
         } else if (inRegion && first >= 'A' && first <= 'Z') {
-            parseField(line, cursor, out.back());
+            parseField(line, newline, out.back());
         }
     }
     return out.size() - before;
