@@ -163,37 +163,58 @@ void VSVestage::setBreakDownPhysVestage(bool enabled) {
 
 // ---- categories -------------------------------------------------------------------
 
+namespace {
+
+// The category of a name in a table being built. Names are the run's shared
+// strings, so each distinct one is looked up by text once; every later
+// object with it finds its category by the string's address.
+class CategoryFinder {
+public:
+    explicit CategoryFinder(VSCategoryTable &table) : _table(table) {}
+
+    VSMemoryCategory &categoryFor(const std::string *name, VSSegmentKind segment) {
+        auto [cached, added] = _byName.try_emplace(name, nullptr);
+        if (added) {
+            const std::string text = name != nullptr ? *name : std::string();
+            auto found = _table.find(text);
+            if (found == _table.end()) {
+                found = _table.emplace(text, VSMemoryCategory(text, segment)).first;
+            }
+            cached->second = &found->second;
+        }
+        return *cached->second;
+    }
+
+private:
+    VSCategoryTable &_table;
+    std::unordered_map<const std::string *, VSMemoryCategory *> _byName;
+};
+
+} // namespace
+
 VSCategoryTable VSVestage::_categoriesForAllProcesses() const {
     VSCategoryTable table;
-    std::unordered_set<const VSMemoryObject *> placed;
+    CategoryFinder finder(table);
+    vs::PointerSet<const VSMemoryObject> placed;
     for (const std::unique_ptr<VSProcess> &process : _processes) {
         for (const std::unique_ptr<VSMemoryRegion> &region : process->memoryRegions()) {
             VSMemoryObject *object = region->memoryObject();
-            if (object == nullptr || !placed.insert(object).second) {
+            if (object == nullptr || !placed.insert(object)) {
                 continue;
             }
-            const std::string name = region->name().value_or("");
-            auto found = table.find(name);
-            if (found == table.end()) {
-                found = table.emplace(name, VSMemoryCategory(name, region->segment())).first;
-            }
-            found->second.addMemoryObject(object);
+            finder.categoryFor(region->sharedName(), region->segment()).addMemoryObject(object);
         }
     }
     return table;
 }
 
-VSCategoryTable VSVestage::_categoriesForObjects(const std::vector<VSMemoryObject *> &objects) const {
+VSCategoryTable VSVestage::_categoriesForObjects(std::span<VSMemoryObject *const> objects) const {
     VSCategoryTable table;
+    CategoryFinder finder(table);
     for (VSMemoryObject *object : objects) {
-        const std::string name = object->name().value_or("");
-        auto found = table.find(name);
-        if (found == table.end()) {
-            const vs::RegionSet &regions = object->memoryRegions();
-            const VSSegmentKind segment = regions.empty() ? VSSegmentUnknown : (*regions.begin())->segment();
-            found = table.emplace(name, VSMemoryCategory(name, segment)).first;
-        }
-        found->second.addMemoryObject(object);
+        const vs::RegionSet &regions = object->memoryRegions();
+        const VSSegmentKind segment = regions.empty() ? VSSegmentUnknown : (*regions.begin())->segment();
+        finder.categoryFor(object->sharedName(), segment).addMemoryObject(object);
     }
     return table;
 }

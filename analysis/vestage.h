@@ -26,6 +26,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <span>
 #include <string>
 #include <unordered_map>
 #include <vector>
@@ -107,7 +108,7 @@ public:
     // first region (in target order, then region order) that maps it.
     VSCategoryTable _categoriesForAllProcesses() const;
     // Categories of a collection of objects, keyed by the objects' names.
-    VSCategoryTable _categoriesForObjects(const std::vector<VSMemoryObject *> &objects) const;
+    VSCategoryTable _categoriesForObjects(std::span<VSMemoryObject *const> objects) const;
     // The table to print: with summarize, foldable categories go into
     // "Other". outTotal receives the sums over all input categories.
     static VSCategoryTable _summarizedCategoriesForCategories(VSCategoryTable categories, bool summarize,

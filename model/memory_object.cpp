@@ -36,13 +36,21 @@ VSMemoryObject::~VSMemoryObject() {
     }
 }
 
+std::optional<std::string> VSMemoryObject::name() const {
+    return _name != nullptr ? std::optional<std::string>(*_name) : std::nullopt;
+}
+
+void VSMemoryObject::setName(const std::optional<std::string> &name) {
+    _name = name ? vs::internedString(*name) : nullptr;
+}
+
 void VSMemoryObject::addRegion(VSMemoryRegion *region, std::uint64_t pageSize) {
     VS_ASSERT(region != nullptr);
     VS_ASSERT(pageSize != 0 && (pageSize & (pageSize - 1)) == 0);
 
     _accurateSizes = false;
-    if (!_name) {
-        _name = region->name();
+    if (_name == nullptr) {
+        _name = region->sharedName();
     }
     _memoryRegions.insert(region);
     if (region->object_id() == 0) {

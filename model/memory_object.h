@@ -66,8 +66,10 @@ public:
     std::uint64_t totalWiredSize() const { return _totalWiredSize; }
 
     // Name of the first added region that had one; nullopt until then.
-    const std::optional<std::string> &name() const { return _name; }
-    void setName(std::optional<std::string> name) { _name = std::move(name); }
+    std::optional<std::string> name() const;
+    void setName(const std::optional<std::string> &name);
+    // The same without a copy: the run-wide shared string, or null.
+    const std::string *sharedName() const { return _name; }
 
     // Every region added, in the order of first addition (non-owning).
     const vs::RegionSet &memoryRegions() const { return _memoryRegions; }
@@ -83,7 +85,7 @@ private:
     std::uint64_t _totalReclaimableSize = 0;
     std::uint64_t _totalSwappedSize = 0;
     std::uint64_t _totalWiredSize = 0;
-    std::optional<std::string> _name;
+    const std::string *_name = nullptr;
     std::unique_ptr<VSRangeListNode> _rangeListHead;
     bool _accurateSizes = false;
 };

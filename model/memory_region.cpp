@@ -3,6 +3,7 @@
 #include <array>
 #include <cstdint>
 #include <cstdio>
+#include <memory>
 #include <mutex>
 #include <unordered_map>
 #include <vector>
@@ -11,13 +12,25 @@
 
 namespace {
 
-// Guards the two strings of every region. Striped by address: a mutex per
-// region would triple its size, and contention is negligible because a
-// region is written by one gathering thread.
-std::mutex &stringLockFor(const VSMemoryRegion *region) {
-    static std::array<std::mutex, 64> locks;
-    auto bits = static_cast<std::uint64_t>(reinterpret_cast<std::uintptr_t>(region));
-    return locks[((bits >> 4) * 0x9E3779B97F4A7C15ull) >> 58];
+const std::string *internedOrNull(const std::optional<std::string> &text) {
+    return text ? vs::internedString(*text) : nullptr;
+}
+
+std::optional<std::string> copyOf(const std::string *text) {
+    return text != nullptr ? std::optional<std::string>(*text) : std::nullopt;
+}
+
+// The run-wide table of shared strings. Each thread keeps its own index of
+// the strings it has seen, so that the gathering threads, which name every
+// region, only take the lock for a text new to them.
+struct StringPool {
+    std::mutex lock;
+    std::unordered_map<std::string_view, std::unique_ptr<const std::string>> strings;
+};
+
+StringPool &stringPool() {
+    static StringPool *pool = new StringPool; // never destroyed: regions may outlive static teardown
+    return *pool;
 }
 
 // Slot 0 and 240-255 are never consulted. Slots 1-239 that are empty fall
@@ -125,6 +138,8 @@ std::string formatWithNumber(const char *format, int number) {
 
 VSMemoryRegion::VSMemoryRegion(const VSMemoryRegion &other)
     : _memoryObject(other._memoryObject),
+      _name(other.sharedName()),
+      _detailedName(other.sharedDetailedName()),
       _offset(other._offset),
       _start(other._start),
       _size(other._size),
@@ -139,29 +154,14 @@ VSMemoryRegion::VSMemoryRegion(const VSMemoryRegion &other)
       _share_mode(other._share_mode),
       _inSharedCache(other._inSharedCache),
       _unusedSharedCacheRegion(other._unusedSharedCacheRegion),
-      _purgeableNonVolatile(other._purgeableNonVolatile) {
-    std::lock_guard guard(stringLockFor(&other));
-    _name = other._name;
-    _detailedName = other._detailedName;
-}
+      _purgeableNonVolatile(other._purgeableNonVolatile) {}
 
 VSMemoryRegion &VSMemoryRegion::operator=(const VSMemoryRegion &other) {
     if (this == &other) {
         return *this;
     }
-    // Never hold two stripes at once: both regions may share one.
-    std::optional<std::string> name;
-    std::optional<std::string> detailedName;
-    {
-        std::lock_guard guard(stringLockFor(&other));
-        name = other._name;
-        detailedName = other._detailedName;
-    }
-    {
-        std::lock_guard guard(stringLockFor(this));
-        _name.swap(name);
-        _detailedName.swap(detailedName);
-    }
+    setSharedName(other.sharedName());
+    setSharedDetailedName(other.sharedDetailedName());
     _memoryObject = other._memoryObject;
     _offset = other._offset;
     _start = other._start;
@@ -181,27 +181,14 @@ VSMemoryRegion &VSMemoryRegion::operator=(const VSMemoryRegion &other) {
     return *this;
 }
 
-std::optional<std::string> VSMemoryRegion::name() const {
-    std::lock_guard guard(stringLockFor(this));
-    return _name;
-}
+std::optional<std::string> VSMemoryRegion::name() const { return copyOf(sharedName()); }
 
-void VSMemoryRegion::setName(std::optional<std::string> name) {
-    {
-        std::lock_guard guard(stringLockFor(this));
-        _name.swap(name);
-    }
-    // The old string is released here, outside the lock.
-}
+void VSMemoryRegion::setName(std::optional<std::string> name) { setSharedName(internedOrNull(name)); }
 
-std::optional<std::string> VSMemoryRegion::detailedName() const {
-    std::lock_guard guard(stringLockFor(this));
-    return _detailedName;
-}
+std::optional<std::string> VSMemoryRegion::detailedName() const { return copyOf(sharedDetailedName()); }
 
 void VSMemoryRegion::setDetailedName(std::optional<std::string> detailedName) {
-    std::lock_guard guard(stringLockFor(this));
-    _detailedName.swap(detailedName);
+    setSharedDetailedName(internedOrNull(detailedName));
 }
 
 void VSMemoryRegion::setEnd(std::uint64_t end) {
@@ -263,6 +250,27 @@ std::uint32_t registerDynamicTagName(const std::string &name) {
     registry.names.push_back(name);
     registry.tagForName.emplace(name, tag);
     return tag;
+}
+
+const std::string *internedString(std::string_view text) {
+    thread_local std::unordered_map<std::string_view, const std::string *> seen;
+    if (auto found = seen.find(text); found != seen.end()) {
+        return found->second;
+    }
+    StringPool &pool = stringPool();
+    const std::string *shared;
+    {
+        std::lock_guard guard(pool.lock);
+        auto found = pool.strings.find(text);
+        if (found == pool.strings.end()) {
+            auto copy = std::make_unique<const std::string>(text);
+            const std::string_view key = *copy;
+            found = pool.strings.emplace(key, std::move(copy)).first;
+        }
+        shared = found->second.get();
+    }
+    seen.emplace(*shared, shared);
+    return shared;
 }
 
 std::optional<std::string> dynamicTagName(std::uint32_t tag) {

@@ -8,13 +8,17 @@
 // and the region points back through a plain non-owning pointer.
 //
 // name and detailedName may be replaced while another thread reads them:
-// a reader gets either the whole old or the whole new string. The lock
-// for that lives outside the region (a small striped table) so that the
-// many thousands of regions of a run stay small.
+// a reader gets either the whole old or the whole new string. Both are
+// kept as pointers to run-wide shared copies (vs::internedString), swapped
+// atomically: a run has many thousands of regions and only a few hundred
+// distinct names, so no region holds a string, an allocation or a lock of
+// its own.
 
+#include <atomic>
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <string_view>
 
 class VSMemoryObject;
 
@@ -47,6 +51,13 @@ public:
     // Text printed after the name in the region listing; may be absent.
     std::optional<std::string> detailedName() const;
     void setDetailedName(std::optional<std::string> detailedName);
+
+    // The same two texts without a copy: the run-wide shared string
+    // (vs::internedString), or null when absent.
+    const std::string *sharedName() const { return _name.load(std::memory_order_acquire); }
+    void setSharedName(const std::string *name) { _name.store(name, std::memory_order_release); }
+    const std::string *sharedDetailedName() const { return _detailedName.load(std::memory_order_acquire); }
+    void setSharedDetailedName(const std::string *name) { _detailedName.store(name, std::memory_order_release); }
 
     std::uint64_t offset() const { return _offset; }
     void setOffset(std::uint64_t offset) { _offset = offset; }
@@ -112,8 +123,8 @@ public:
 
 private:
     VSMemoryObject *_memoryObject = nullptr;
-    std::optional<std::string> _name;
-    std::optional<std::string> _detailedName;
+    std::atomic<const std::string *> _name{nullptr};
+    std::atomic<const std::string *> _detailedName{nullptr};
     std::uint64_t _offset = 0;
     std::uint64_t _start = 0;
     std::uint64_t _size = 0;
@@ -166,6 +177,10 @@ const char *userTagTableName(std::uint32_t tag);
 // handing out a new one on first use; the same name gets the same tag for
 // the rest of the run. Thread-safe.
 std::uint32_t registerDynamicTagName(const std::string &name);
+
+// The run-wide copy of `text`: equal texts give the same string, which
+// lives until the program ends. Thread-safe.
+const std::string *internedString(std::string_view text);
 
 // The name registered for a dynamic tag, or nullopt. Thread-safe.
 std::optional<std::string> dynamicTagName(std::uint32_t tag);

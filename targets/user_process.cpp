@@ -3,8 +3,11 @@
 #include <algorithm>
 #include <cstdio>
 #include <filesystem>
+#include <mutex>
 #include <span>
 #include <system_error>
+#include <unordered_map>
+#include <utility>
 
 #include "model/assert.h"
 
@@ -45,13 +48,23 @@ std::string joined(const std::optional<std::string> &first, const std::optional<
 
 // Owner paths are shown with symbolic links resolved; a path that cannot be
 // resolved (gone, or in another mount namespace) is shown as reported.
+// Resolving asks the file system about every component of the path, and
+// every process of a run maps the same few libraries: each path is resolved
+// once per run.
 std::string resolvedPath(const std::string &path) {
+    static std::mutex lock;
+    static std::unordered_map<std::string, std::string> resolvedPaths;
+    {
+        std::lock_guard<std::mutex> guard(lock);
+        if (auto found = resolvedPaths.find(path); found != resolvedPaths.end()) {
+            return found->second;
+        }
+    }
     std::error_code error;
     std::filesystem::path resolved = std::filesystem::weakly_canonical(path, error);
-    if (error || resolved.empty()) {
-        return path;
-    }
-    return resolved.string();
+    std::string result = (error || resolved.empty()) ? path : resolved.string();
+    std::lock_guard<std::mutex> guard(lock);
+    return resolvedPaths.try_emplace(path, std::move(result)).first->second;
 }
 
 }  // namespace
@@ -212,6 +225,12 @@ void VSUserProcess::_gatherMemoryData() {
     _hasCachedDisposition = false;
     _pendingUnusedSharedRegion = nullptr;
 
+    // Region names repeat: each distinct one is made a shared string once
+    // per walk (per image, per tag), not once per region.
+    const std::string *const mappedFileName = vs::internedString("mapped file");
+    std::unordered_map<const VSImage *, std::pair<const std::string *, const std::string *>> imageNames;
+    std::unordered_map<uint64_t, const std::string *> tagNames;
+
     const uint64_t sharedEnd = _sharedRegionBase + _sharedRegionSize;
     enumerateRegions([&](uint64_t start, uint64_t size, VSRegionInfo &info, int32_t purgeableState,
                          const std::optional<std::string> &path) {
@@ -235,22 +254,33 @@ void VSUserProcess::_gatherMemoryData() {
         region->setSegment(VSSegmentNone);
 
         if (const VSImage *image = images.nextImageForStart(start, start + size)) {
-            region->setName(joined(image->name(), image->ownerPath()));
-            region->setDetailedName(image->ownerPath());
+            auto [names, added] = imageNames.try_emplace(image);
+            if (added) {
+                names->second.first = vs::internedString(joined(image->name(), image->ownerPath()));
+                names->second.second = image->ownerPath() ? vs::internedString(*image->ownerPath()) : nullptr;
+            }
+            region->setSharedName(names->second.first);
+            region->setSharedDetailedName(names->second.second);
             region->setSegment(image->segment());
         } else if (path || info.externalPager != 0) {
-            region->setName(std::string("mapped file"));
-            region->setDetailedName(path);
+            region->setSharedName(mappedFileName);
+            region->setSharedDetailedName(path ? vs::internedString(*path) : nullptr);
         } else {
-            std::optional<std::string> name = VSMemoryRegion::categoryNameForTag(info.userTag);
-            if (!name || name->empty()) {
-                name = kUntaggedName;
+            const bool purgeableNonVolatile = purgeableState == VSPurgeableNonVolatile && breakDown;
+            const uint64_t key = (uint64_t{info.userTag} << 1) | (purgeableNonVolatile ? 1 : 0);
+            auto [name, added] = tagNames.try_emplace(key, nullptr);
+            if (added) {
+                std::optional<std::string> text = VSMemoryRegion::categoryNameForTag(info.userTag);
+                if (!text || text->empty()) {
+                    text = kUntaggedName;
+                }
+                if (purgeableNonVolatile) {
+                    *text += " (purgeable non-volatile)";
+                }
+                name->second = vs::internedString(*text);
             }
-            if (purgeableState == VSPurgeableNonVolatile && breakDown) {
-                region->setPurgeableNonVolatile(true);
-                *name += " (purgeable non-volatile)";
-            }
-            region->setName(std::move(name));
+            region->setPurgeableNonVolatile(purgeableNonVolatile);
+            region->setSharedName(name->second);
         }
         regions.push_back(std::move(region));
         return false;
