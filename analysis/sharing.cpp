@@ -17,6 +17,11 @@ bool ProcessGroupLess::operator()(const VSProcessGroup &a, const VSProcessGroup 
 } // namespace vs
 
 void VSVestageSharingData::adoptMemoryObjects(std::vector<std::unique_ptr<VSMemoryObject>> objects) {
+    if (_ownedObjects.empty()) {
+        _ownedObjects = std::move(objects);
+        return;
+    }
+    _ownedObjects.reserve(_ownedObjects.size() + objects.size());
     for (std::unique_ptr<VSMemoryObject> &object : objects) {
         _ownedObjects.push_back(std::move(object));
     }

@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <cstdio>
 #include <cstring>
+#include <initializer_list>
 #include <unordered_set>
 
 #include "analysis/work_queue.h"
@@ -71,6 +72,12 @@ void VSVestage::gatherData() {
     if (_earlyExit.load()) {
         VSProcess::_addGlobalError(kEarlyExitError);
     }
+    // Most regions get an object of their own: make room for all at once.
+    std::size_t regionCount = 0;
+    for (const std::unique_ptr<VSProcess> &process : _processes) {
+        regionCount += process->memoryRegions().size();
+    }
+    _memoryObjects.reserve(regionCount);
     for (const std::unique_ptr<VSProcess> &process : _processes) {
         _addProcess(*process);
     }
@@ -268,10 +275,11 @@ VSSortedCategoryKeys VSVestage::_sortedKeysForCategories(const VSCategoryTable &
 
 std::uint64_t VSVestage::_calculateVestageForProcess(const VSProcess &process) const {
     std::uint64_t vestage = 0;
-    std::unordered_set<const VSMemoryObject *> counted;
+    vs::PointerSet<const VSMemoryObject> counted;
+    counted.reserve(process.memoryRegions().size());
     for (const std::unique_ptr<VSMemoryRegion> &region : process.memoryRegions()) {
         const VSMemoryObject *object = region->memoryObject();
-        if (object != nullptr && counted.insert(object).second) {
+        if (object != nullptr && counted.insert(object)) {
             vestage += object->totalDirtySize() + object->totalSwappedSize();
         }
     }
@@ -310,9 +318,22 @@ std::vector<VSProcess *> VSVestage::_getProcessListSortedByVestage() const {
 // ---- sharing ------------------------------------------------------------------------------
 
 std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
-    // Phase one: the group of every object, objects in the order first met.
-    std::vector<std::pair<VSMemoryObject *, VSProcessGroup>> objectToProcesses;
-    std::unordered_map<const VSMemoryObject *, std::size_t> indexOfObject;
+    // Phase one: the members of every object, objects in the order first
+    // met. Most objects have one member, which is kept in place; the members
+    // of the others go to a list of their own.
+    struct Members {
+        const VSProcess *first = nullptr;
+        std::size_t more = 0; // 0, or 1 + the index of the object's list in `lists`
+    };
+    vs::PointerSet<VSMemoryObject> objects;
+    std::vector<Members> membersOfObject;
+    std::vector<VSProcessGroup> lists;
+    std::size_t regionCount = 0;
+    for (const std::unique_ptr<VSProcess> &process : _processes) {
+        regionCount += process->memoryRegions().size();
+    }
+    objects.reserve(regionCount);
+    membersOfObject.reserve(regionCount);
     // With distinct pids (every live run) a target that is already a member
     // of a group was the last one added, since targets are visited one after
     // another: no search through the members is needed.
@@ -322,51 +343,71 @@ std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
     }
     const bool distinctPids = pids.size() == _processes.size();
     for (const std::unique_ptr<VSProcess> &process : _processes) {
-        std::size_t lastIndex = SIZE_MAX;
+        const VSProcess *const target = process.get();
         const VSMemoryObject *lastObject = nullptr;
         for (const std::unique_ptr<VSMemoryRegion> &region : process->memoryRegions()) {
             VSMemoryObject *object = region->memoryObject();
-            if (object == nullptr) {
+            if (object == nullptr || object == lastObject) {
+                continue; // the same object again: target already a member
+            }
+            lastObject = object;
+            const auto [index, added] = objects.insertIndex(object);
+            if (added) {
+                membersOfObject.push_back({target, 0});
                 continue;
             }
-            std::size_t index = lastIndex;
-            if (object != lastObject) {
-                auto [found, added] = indexOfObject.try_emplace(object, objectToProcesses.size());
-                if (added) {
-                    objectToProcesses.emplace_back(object, VSProcessGroup{});
-                }
-                index = found->second;
-                lastObject = object;
-                lastIndex = index;
-            }
-            VSProcessGroup &group = objectToProcesses[index].second;
+            Members &members = membersOfObject[index];
+            const VSProcess *last = members.more == 0 ? members.first : lists[members.more - 1].back();
             // Members are distinct by pid; the first target with a pid stays.
-            bool member;
-            if (distinctPids) {
-                member = !group.empty() && group.back() == process.get();
-            } else {
-                member = std::any_of(group.begin(), group.end(),
-                                     [&](const VSProcess *p) { return p->pid() == process->pid(); });
+            bool member = last == target;
+            if (!member && !distinctPids) {
+                member = members.first->pid() == target->pid();
+                if (!member && members.more != 0) {
+                    const VSProcessGroup &list = lists[members.more - 1];
+                    member = std::any_of(list.begin(), list.end(),
+                                         [&](const VSProcess *p) { return p->pid() == target->pid(); });
+                }
             }
-            if (!member) {
-                group.push_back(process.get());
+            if (member) {
+                continue;
             }
+            if (members.more == 0) {
+                lists.push_back({members.first});
+                members.more = lists.size();
+            }
+            lists[members.more - 1].push_back(target);
         }
     }
 
     // Phase two: objects by group, groups by target.
     VSVestageSharingData::ProcessGroupToObjects processGroupToObjects;
     VSVestageSharingData::ProcessToProcessGroups processToProcessGroups;
-    for (auto &[object, group] : objectToProcesses) {
-        std::stable_sort(group.begin(), group.end(),
-                         [](const VSProcess *a, const VSProcess *b) { return a->pid() < b->pid(); });
+    auto objectsOfGroup = [&](const VSProcessGroup &group) -> vs::MemoryObjectSet & {
         auto [entry, newGroup] = processGroupToObjects.try_emplace(group);
-        entry->second.insert(object);
         if (newGroup) {
             for (const VSProcess *member : group) {
                 processToProcessGroups[member->asNumber()].insert(group);
             }
         }
+        return entry->second;
+    };
+    // A target's private group is looked up once, not once per object.
+    std::unordered_map<const VSProcess *, vs::MemoryObjectSet *> privateObjects;
+    for (std::size_t i = 0; i < membersOfObject.size(); ++i) {
+        VSMemoryObject *object = objects.items()[i];
+        const Members &members = membersOfObject[i];
+        if (members.more == 0) {
+            vs::MemoryObjectSet *&set = privateObjects[members.first];
+            if (set == nullptr) {
+                set = &objectsOfGroup(VSProcessGroup{members.first});
+            }
+            set->insert(object);
+            continue;
+        }
+        VSProcessGroup &group = lists[members.more - 1];
+        std::stable_sort(group.begin(), group.end(),
+                         [](const VSProcess *a, const VSProcess *b) { return a->pid() < b->pid(); });
+        objectsOfGroup(group).insert(object);
     }
 
     auto sharing = std::make_unique<VSVestageSharingData>();
@@ -376,18 +417,24 @@ std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
 }
 
 void VSVestage::_releaseMemoryObjectsTo(VSVestageSharingData &sharing) {
-    MemoryObjectList objects;
-    for (MemoryObjectTable *table : {&_memoryObjects, &_kernelMemoryObjects, &_sharedCache64MemoryObjects,
-                                     &_sharedCache32MemoryObjects, &_textMemoryObjects, &_linkeditMemoryObjects}) {
+    const std::initializer_list<MemoryObjectTable *> tables = {
+        &_memoryObjects,      &_kernelMemoryObjects, &_sharedCache64MemoryObjects, &_sharedCache32MemoryObjects,
+        &_textMemoryObjects, &_linkeditMemoryObjects};
+    // The list of unique objects is handed over whole, with the tables'
+    // objects appended to it in one step.
+    MemoryObjectList objects = std::move(_uniqueMemoryObjects);
+    _uniqueMemoryObjects.clear();
+    std::size_t count = objects.size();
+    for (const MemoryObjectTable *table : tables) {
+        count += table->size();
+    }
+    objects.reserve(count);
+    for (MemoryObjectTable *table : tables) {
         for (auto &entry : *table) {
             objects.push_back(std::move(entry.second));
         }
         table->clear();
     }
-    for (std::unique_ptr<VSMemoryObject> &object : _uniqueMemoryObjects) {
-        objects.push_back(std::move(object));
-    }
-    _uniqueMemoryObjects.clear();
     sharing.adoptMemoryObjects(std::move(objects));
 }
 

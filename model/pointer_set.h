@@ -14,6 +14,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <span>
+#include <utility>
 #include <vector>
 
 #include "model/assert.h"
@@ -26,50 +27,82 @@ public:
     using const_iterator = T *const *;
 
     // Adds p unless it is already present. Returns true when it was added.
-    bool insert(T *p) {
+    bool insert(T *p) { return insertIndex(p).second; }
+
+    // Adds p unless it is already present. Returns p's position in the
+    // order of first addition, and whether it was added now.
+    std::pair<std::size_t, bool> insertIndex(T *p) {
         VS_ASSERT(p != nullptr);
-        if (contains(p)) {
-            return false;
+        if (const std::size_t found = indexOf(p); found != kNotFound) {
+            return {found, false};
         }
-        if (_more.empty() && _one == nullptr) {
+        if (_more.empty() && _slots.empty() && _one == nullptr) {
             _one = p;
-            return true;
+            return {0, true};
         }
-        if (_more.empty()) {
+        if (_more.empty() && _one != nullptr) {
             _more.reserve(4);
             _more.push_back(_one);
         }
         _more.push_back(p);
+        const std::size_t index = _more.size() - 1;
         if (!_slots.empty()) {
-            if ((_more.size() * 2) > _slots.size()) {
+            if (_more.size() * 2 > _slots.size()) {
                 _rebuildIndex(_slots.size() * 2);
             } else {
-                _place(p);
+                _place(index);
             }
         } else if (_more.size() > kLinearLimit) {
             _rebuildIndex(64);
         }
-        return true;
+        return {index, true};
     }
 
-    bool contains(const T *p) const {
+    static constexpr std::size_t kNotFound = static_cast<std::size_t>(-1);
+
+    // p's position in the order of first addition, or kNotFound.
+    std::size_t indexOf(const T *p) const {
         if (!_slots.empty()) {
             const std::size_t mask = _slots.size() - 1;
             for (std::size_t i = _slotFor(p, mask);; i = (i + 1) & mask) {
-                if (_slots[i] == p) {
-                    return true;
+                const std::uint32_t slot = _slots[i];
+                if (slot == 0) {
+                    return kNotFound;
                 }
-                if (_slots[i] == nullptr) {
-                    return false;
+                if (_more[slot - 1] == p) {
+                    return slot - 1;
                 }
             }
         }
-        for (T *q : *this) {
-            if (q == p) {
-                return true;
+        const std::size_t count = size();
+        const_iterator members = begin();
+        for (std::size_t i = 0; i < count; ++i) {
+            if (members[i] == p) {
+                return i;
             }
         }
-        return false;
+        return kNotFound;
+    }
+
+    bool contains(const T *p) const { return indexOf(p) != kNotFound; }
+
+    // Room for `count` members without growing the index again.
+    void reserve(std::size_t count) {
+        if (count <= kLinearLimit) {
+            return;
+        }
+        std::size_t slots = 64;
+        while (slots < count * 2) {
+            slots *= 2;
+        }
+        if (slots <= _slots.size()) {
+            return;
+        }
+        if (_more.empty() && _one != nullptr) {
+            _more.push_back(_one);
+        }
+        _more.reserve(count);
+        _rebuildIndex(slots);
     }
 
     // Adds every member of other, keeping other's order for the new ones.
@@ -94,28 +127,29 @@ private:
         return static_cast<std::size_t>(((bits >> 3) * 0x9E3779B97F4A7C15ull) >> 32) & mask;
     }
 
-    void _place(T *p) {
+    void _place(std::size_t index) {
         const std::size_t mask = _slots.size() - 1;
-        std::size_t i = _slotFor(p, mask);
-        while (_slots[i] != nullptr) {
+        std::size_t i = _slotFor(_more[index], mask);
+        while (_slots[i] != 0) {
             i = (i + 1) & mask;
         }
-        _slots[i] = p;
+        _slots[i] = static_cast<std::uint32_t>(index + 1);
     }
 
     void _rebuildIndex(std::size_t slots) {
-        _slots.assign(slots, nullptr);
-        for (T *q : _more) {
-            _place(q);
+        _slots.assign(slots, 0);
+        for (std::size_t index = 0; index < _more.size(); ++index) {
+            _place(index);
         }
     }
 
-    // The only member while there is at most one; afterwards the members
-    // live in _more and _one is no longer read.
+    // The only member while there is at most one and no index; afterwards
+    // the members live in _more and _one is no longer read.
     T *_one = nullptr;
     std::vector<T *> _more;
-    // Empty, or a power-of-two table at most half full (null = free slot).
-    std::vector<T *> _slots;
+    // Empty, or a power-of-two table at most half full: 0 is a free slot,
+    // anything else a position in _more plus one.
+    std::vector<std::uint32_t> _slots;
 };
 
 } // namespace vs
