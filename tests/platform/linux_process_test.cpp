@@ -154,6 +154,16 @@ TEST_F(LinuxProcessTest, ArrangedMemoryPageForPage) {
         EXPECT_EQ(std::make_tuple(address, size, basic.protection), std::make_tuple(start, r->size, r->info.protection));
     }
 
+    // A walk that reached the end gave its parse back; walking the same
+    // handle again parses anew and finds the same regions.
+    std::vector<WalkedRegion> again;
+    ASSERT_EQ(walk(platform, task, again), vs::kReturnNoMoreRegions);
+    ASSERT_EQ(again.size(), regions.size());
+    for (size_t i = 0; i < regions.size(); ++i) {
+        EXPECT_EQ(std::tie(again[i].start, again[i].size, again[i].info.userTag, again[i].info.protection),
+                  std::tie(regions[i].start, regions[i].size, regions[i].info.userTag, regions[i].info.protection));
+    }
+
     // The blocked thread's stack is "stack"; the no-access page the thread
     // library leaves below it is "guard".
     const WalkedRegion *stack = containing(regions, hex(child, "t", "local"));

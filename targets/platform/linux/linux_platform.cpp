@@ -25,6 +25,19 @@ using vs::SmapsRegion;
 using vs::UniqueFd;
 
 struct VSLinuxPlatform::Task {
+    // The memory lines of /proc/PID/status that the process-wide counters use.
+    struct StatusFigures {
+        std::optional<uint64_t> anon, shmem, swap, pte, peak, threads;
+
+        explicit StatusFigures(std::string_view status)
+            : anon(vs::statusBytes(status, "RssAnon")),
+              shmem(vs::statusBytes(status, "RssShmem")),
+              swap(vs::statusBytes(status, "VmSwap")),
+              pte(vs::statusBytes(status, "VmPTE")),
+              peak(vs::statusBytes(status, "VmHWM")),
+              threads(vs::statusBytes(status, "Threads")) {}
+    };
+
     int32_t pid = 0;
     UniqueFd dir;
 
@@ -34,6 +47,10 @@ struct VSLinuxPlatform::Task {
     std::vector<SmapsRegion> regions;
     std::vector<vs::MappingKind> kinds;
     std::vector<VSRegionInfo> infos;
+    // The status read for the kernel-memory counters, kept for the one
+    // resource-usage query that a target makes right after it (both are
+    // taken at construction); used once, then dropped.
+    std::optional<StatusFigures> status;
 };
 
 namespace {
@@ -313,16 +330,22 @@ int32_t VSLinuxPlatform::pid_resource_usage(int32_t pid, int32_t version,
     if (version != vs::kResourceUsageVersion4 || pid <= 0) {
         return EINVAL;
     }
-    std::string_view status;
-    const int error = readPidFile(pid, "status", status);
-    if (error != 0) {
-        return error == ENOENT ? ESRCH : error;
+    // A target asks right after its kernel-memory counters, which read the
+    // same file through its handle: answer from that read when there is one.
+    std::optional<Task::StatusFigures> kept;
+    if (std::shared_ptr<Task> task = _newestTaskForPid(pid)) {
+        std::lock_guard<std::mutex> lock(task->mutex);
+        kept.swap(task->status);
     }
-    const auto anon = vs::statusBytes(status, "RssAnon");
-    const auto shmem = vs::statusBytes(status, "RssShmem");
-    const auto swap = vs::statusBytes(status, "VmSwap");
-    const auto pte = vs::statusBytes(status, "VmPTE");
-    const auto peak = vs::statusBytes(status, "VmHWM");
+    if (!kept) {
+        std::string_view status;
+        const int error = readPidFile(pid, "status", status);
+        if (error != 0) {
+            return error == ENOENT ? ESRCH : error;
+        }
+        kept.emplace(status);
+    }
+    const auto &[anon, shmem, swap, pte, peak, threads] = *kept;
     if (!anon || !shmem || !swap || !pte || !peak) {
         return ESRCH; // a zombie has no memory lines
     }
@@ -354,40 +377,46 @@ int32_t VSLinuxPlatform::pid_resource_usage(int32_t pid, int32_t version,
 
 int32_t VSLinuxPlatform::pid_region_filename(int32_t pid, uint64_t address,
                                              std::span<char> buffer) {
-    std::string path;
+    // Answered from the parse of a handle for the pid: the first parsed one.
+    // Handles and tasks are only locked one after the other, never the
+    // other way round.
+    std::string_view path;
     bool found = false;
-    std::vector<std::shared_ptr<Task>> candidates;
+    std::shared_ptr<Task> held; // keeps the task whose path is read
+    std::unique_lock<std::mutex> taskLock;
     {
         std::lock_guard<std::mutex> lock(_tasksMutex);
         auto [first, last] = _handlesByPid.equal_range(pid);
-        for (auto it = first; it != last; ++it) {
-            candidates.push_back(_tasks.at(it->second));
+        for (auto it = first; it != last && !held; ++it) {
+            const std::shared_ptr<Task> &task = _tasks.at(it->second);
+            std::unique_lock<std::mutex> candidateLock(task->mutex);
+            if (!task->parsed || task->parseCode != 0) {
+                continue;
+            }
+            held = task;
+            taskLock = std::move(candidateLock);
         }
     }
-    for (auto &task : candidates) {
-        std::lock_guard<std::mutex> lock(task->mutex);
-        if (!task->parsed || task->parseCode != 0) {
-            continue;
-        }
-        const size_t i = regionAtOrAbove(task->regions, address);
-        if (i < task->regions.size() && task->regions[i].start <= address) {
-            path = task->regions[i].path;
+    if (held) {
+        const size_t i = regionAtOrAbove(held->regions, address);
+        if (i < held->regions.size() && held->regions[i].start <= address) {
+            path = held->regions[i].path;
             found = true;
         }
-        break;
     }
+    std::vector<SmapsRegion> mapsRegions;
     if (!found) {
+        taskLock = {};
         std::string_view maps;
         if (pid <= 0 || readPidFile(pid, "maps", maps) != 0) {
             return 0;
         }
-        std::vector<SmapsRegion> regions;
-        vs::parseSmaps(maps, regions);
-        const size_t i = regionAtOrAbove(regions, address);
-        if (i >= regions.size() || regions[i].start > address) {
+        vs::parseSmaps(maps, mapsRegions);
+        const size_t i = regionAtOrAbove(mapsRegions, address);
+        if (i >= mapsRegions.size() || mapsRegions[i].start > address) {
             return 0;
         }
-        path = regions[i].path;
+        path = mapsRegions[i].path;
     }
     if (path.empty() || path[0] == '[') {
         return 0; // anonymous memory and the kernel's pseudo mappings
@@ -399,12 +428,16 @@ int32_t VSLinuxPlatform::pid_region_filename(int32_t pid, uint64_t address,
 
 int32_t VSLinuxPlatform::argument_area_max_size(int32_t &size) {
     // The arguments and environment share ARG_MAX; the area adds the
-    // executable path and the count in front.
-    long argMax = ::sysconf(_SC_ARG_MAX);
-    if (argMax <= 0 || argMax > 16 * 1024 * 1024) {
-        argMax = 2 * 1024 * 1024;
-    }
-    size = static_cast<int32_t>(argMax + PATH_MAX + 16);
+    // executable path and the count in front. Asked once per target, it
+    // is worked out once (the C library asks the kernel every time).
+    std::call_once(_argumentAreaOnce, [this] {
+        long argMax = ::sysconf(_SC_ARG_MAX);
+        if (argMax <= 0 || argMax > 16 * 1024 * 1024) {
+            argMax = 2 * 1024 * 1024;
+        }
+        _argumentAreaSize = static_cast<int32_t>(argMax + PATH_MAX + 16);
+    });
+    size = _argumentAreaSize;
     return 0;
 }
 
@@ -414,13 +447,20 @@ int32_t VSLinuxPlatform::process_argument_area(int32_t pid, std::span<char> buff
     if (pid <= 0) {
         return ESRCH;
     }
-    const int dirFd = openProc(pid, O_RDONLY | O_DIRECTORY);
-    if (dirFd < 0) {
-        return errno == ENOENT ? ESRCH : errno;
+    // A target names itself right after opening its task: read through the
+    // directory its handle holds rather than open /proc/PID once more.
+    UniqueFd dir;
+    std::shared_ptr<Task> task = _newestTaskForPid(pid);
+    if (!task) {
+        const int dirFd = openProc(pid, O_RDONLY | O_DIRECTORY);
+        if (dirFd < 0) {
+            return errno == ENOENT ? ESRCH : errno;
+        }
+        dir = UniqueFd(dirFd);
     }
-    UniqueFd dir(dirFd);
+    const int dirFd = task ? task->dir.get() : dir.get();
     char exe[PATH_MAX + 1];
-    const ssize_t exeLength = ::readlinkat(dir.get(), "exe", exe, PATH_MAX);
+    const ssize_t exeLength = ::readlinkat(dirFd, "exe", exe, PATH_MAX);
     if (exeLength <= 0) {
         return exeLength == 0 ? ENOENT : errno;
     }
@@ -430,7 +470,7 @@ int32_t VSLinuxPlatform::process_argument_area(int32_t pid, std::span<char> buff
         exePath.remove_suffix(kDeleted.size()); // the name is what matters
     }
     std::string_view cmdline;
-    if (vs::readFileAt(dir.get(), "cmdline", cmdline) != 0) {
+    if (vs::readFileAt(dirFd, "cmdline", cmdline) != 0) {
         cmdline = {};
     }
 
@@ -454,6 +494,19 @@ uint64_t VSLinuxPlatform::target_platform_code(int32_t, bool) {
 }
 
 // ---- tasks -------------------------------------------------------------------------------
+
+std::shared_ptr<VSLinuxPlatform::Task> VSLinuxPlatform::_newestTaskForPid(int32_t pid) {
+    std::lock_guard<std::mutex> lock(_tasksMutex);
+    auto [first, last] = _handlesByPid.equal_range(pid);
+    if (first == last) {
+        return nullptr;
+    }
+    VSTaskHandle newest = first->second;
+    for (auto it = first; it != last; ++it) {
+        newest = std::max(newest, it->second);
+    }
+    return _tasks.at(newest);
+}
 
 std::shared_ptr<VSLinuxPlatform::Task> VSLinuxPlatform::_task(VSTaskHandle handle) {
     std::lock_guard<std::mutex> lock(_tasksMutex);
@@ -528,6 +581,8 @@ VSReturnCode VSLinuxPlatform::_parse(Task &task) {
     if (error != 0) {
         return (error == ESRCH || error == ENOENT) ? vs::kReturnDeadPort : regionErrno(error);
     }
+    // About 700 bytes of text per mapping; a close guess saves regrowing.
+    task.regions.reserve(text.size() / 640 + 1);
     vs::parseSmaps(text, task.regions);
     if (task.regions.empty() && processHasGone(task.dir.get())) {
         return vs::kReturnDeadPort;
@@ -545,6 +600,14 @@ VSReturnCode VSLinuxPlatform::_parse(Task &task) {
         task.infos.push_back(vs::regionInfoFor(region, kind, tag, objectId, _pageSize));
     }
     return 0;
+}
+
+void VSLinuxPlatform::_releaseParse(Task &task) {
+    std::vector<SmapsRegion>().swap(task.regions);
+    std::vector<vs::MappingKind>().swap(task.kinds);
+    std::vector<VSRegionInfo>().swap(task.infos);
+    task.parsed = false;
+    task.parseCode = 0;
 }
 
 VSReturnCode VSLinuxPlatform::_ensureParsed(Task &task) {
@@ -572,6 +635,10 @@ VSReturnCode VSLinuxPlatform::region_recurse(VSTaskHandle handle, uint64_t &addr
     }
     const size_t i = regionAtOrAbove(task->regions, address);
     if (i >= task->regions.size()) {
+        // The walk has passed the last region and is done with the parse:
+        // a run over every process then holds one parse per thread at a
+        // time, not one per target. Asked again, the handle parses anew.
+        _releaseParse(*task);
         return vs::kReturnNoMoreRegions;
     }
     address = task->regions[i].start;
@@ -765,14 +832,17 @@ VSReturnCode VSLinuxPlatform::task_memory_info(VSTaskHandle handle, VSTaskKernel
     if (error != 0) {
         return (error == ESRCH || error == ENOENT) ? vs::kReturnDeadPort : error;
     }
-    const auto pte = vs::statusBytes(status, "VmPTE");
-    const auto threads = vs::statusBytes(status, "Threads");
-    if (!pte || !threads) {
+    Task::StatusFigures figures(status);
+    if (!figures.pte || !figures.threads) {
         return vs::kReturnDeadPort;
     }
     // Page tables and the kernel stacks of the threads are the memory the
     // kernel keeps for this process alone.
-    info.privateAllocated = *pte + *threads * kKernelStackSize;
+    info.privateAllocated = *figures.pte + *figures.threads * kKernelStackSize;
+    {
+        std::lock_guard<std::mutex> lock(task->mutex);
+        task->status.emplace(std::move(figures));
+    }
     count = vs::kTaskKernelMemoryInfoCount;
     return 0;
 }

@@ -8,8 +8,9 @@
 // so a handle never reads a process that reused the pid.
 //
 // The region queries answer from one parse of /proc/PID/smaps per handle,
-// made on first use and kept on the handle: the images (symbolicator) and
-// the walk (region_recurse, region_info) then see the same address space.
+// made on first use and kept on the handle until a walk has passed the last
+// region: the images (symbolicator) and the walk (region_recurse,
+// region_info) then see the same address space.
 // Linux has no submaps and no shared cache region.
 //
 // Codes: 0 success; 1 past the last region; 4 for page queries of a
@@ -97,10 +98,14 @@ private:
     struct KernelArrays;
 
     std::shared_ptr<Task> _task(VSTaskHandle handle);
+    // The task of the most recent handle opened for a pid, or null.
+    std::shared_ptr<Task> _newestTaskForPid(int32_t pid);
     VSTaskHandle _registerTask(std::shared_ptr<Task> task);
     // Parses smaps once per task; returns the region query code.
     VSReturnCode _ensureParsed(Task &task);
     VSReturnCode _parse(Task &task);
+    // Forgets the parse; the next region query parses again.
+    void _releaseParse(Task &task);
     const std::vector<uint64_t> &_tmpfsDevices();
 
     uint64_t _pageSize;
@@ -118,6 +123,9 @@ private:
 
     std::once_flag _swapOnce;
     bool _swapConfigured = false;
+
+    std::once_flag _argumentAreaOnce;
+    int32_t _argumentAreaSize = 0;
 
     std::mutex _kernelArraysMutex;
     std::vector<std::shared_ptr<KernelArrays>> _kernelArrays;
