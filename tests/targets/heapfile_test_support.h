@@ -1,16 +1,17 @@
 #pragma once
 
-// Small heapfiles for the tests: a snapshot built in code, written to a
-// file of its own that disappears with the test.
+// Small heapfiles for the tests: a snapshot built in code, written to a file
+// of its own that disappears with the test.
 
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <string>
-#include <utility>
 
 #include "targets/heapfile_format.h"
 #include "targets/heapfile_process.h"
@@ -23,15 +24,11 @@ public:
     explicit ScratchFile(const std::string &contents, const std::string &name = "target.heap") {
         static std::atomic<int> counter{0};
         _directory = std::filesystem::temp_directory_path() /
-                     ("vestage-heapfile-test-" + std::to_string(::testing::UnitTest::GetInstance()->random_seed()) +
-                      "-" + std::to_string(counter++) + "-" + std::to_string(reinterpret_cast<uintptr_t>(this)));
+                     ("vestage-test-" + std::to_string(::getpid()) + "-" + std::to_string(counter++));
+        std::filesystem::remove_all(_directory);  // left behind by a crashed run with the same pid
         std::filesystem::create_directories(_directory);
         _path = (_directory / name).string();
-        std::FILE *file = std::fopen(_path.c_str(), "wb");
-        if (file != nullptr) {
-            std::fwrite(contents.data(), 1, contents.size(), file);
-            std::fclose(file);
-        }
+        std::ofstream(_path, std::ios::binary) << contents;
     }
     ~ScratchFile() {
         std::error_code ignored;
@@ -39,7 +36,6 @@ public:
     }
     ScratchFile(const ScratchFile &) = delete;
     ScratchFile &operator=(const ScratchFile &) = delete;
-
     const std::string &path() const { return _path; }
     std::string directory() const { return _directory.string(); }
 
@@ -70,65 +66,27 @@ private:
     std::FILE *_stream;
 };
 
-// A snapshot of pid 4242 "worker" with page size 4096 and no shared region.
+// A snapshot of pid 4242 "worker".
 inline VSHeapfileSnapshot snapshotOf(std::vector<VSHeapfileRegion> regions,
                                      std::string description = "X86-64 process, no shared region",
                                      uint32_t pageSize = 4096) {
-    VSHeapfileSnapshot snapshot;
-    snapshot.pid = 4242;
-    snapshot.name = "worker";
-    snapshot.description = std::move(description);
-    snapshot.pageSize = pageSize;
-    snapshot.regions = std::move(regions);
-    return snapshot;
+    return {4242, "worker", std::move(description), true, pageSize, 0, 0, false, std::move(regions)};
 }
 
 struct RegionSketch {
-    uint64_t address;
-    uint64_t length;
+    uint64_t address, length;
     std::string type;
     std::optional<std::string> path = std::nullopt;
     bool externalPager = false;
     uint32_t userTag = 0;
-    uint64_t resident = 0;
-    uint64_t dirty = 0;
-    uint64_t swapped = 0;
-    uint64_t objectId = 0;
+    uint64_t resident = 0, dirty = 0, swapped = 0, objectId = 0;
     int32_t purgeableState = 3;
 };
 
-inline VSHeapfileRegion region(const RegionSketch &sketch) {
-    VSHeapfileRegion region;
-    region.address = sketch.address;
-    region.length = sketch.length;
-    region.type = sketch.type;
-    region.path = sketch.path;
-    region.externalPager = sketch.externalPager ? 1 : 0;
-    region.userTag = sketch.userTag;
-    region.residentBytes = sketch.resident;
-    region.dirtyBytes = sketch.dirty;
-    region.swappedBytes = sketch.swapped;
-    region.objectId = sketch.objectId;
-    region.purgeableState = sketch.purgeableState;
-    region.protection = 3;
-    region.maxProtection = 7;
-    region.shareMode = 2;
-    region.referenceCount = 1;
-    return region;
+inline VSHeapfileRegion region(const RegionSketch &s) {
+    // Every field in declaration order: protection 3 of 7, one reference, private share mode, not a submap.
+    return {s.address, s.length, s.type, s.path, 3, 7, s.userTag, std::nullopt, s.resident, 0, s.swapped, s.dirty, 1,
+            s.externalPager, 2, 0, s.objectId, s.purgeableState};
 }
-
-// Reaches the protected parts of a heapfile target.
-class OpenHeapfileProcess : public VSHeapfileProcess {
-public:
-    static std::unique_ptr<OpenHeapfileProcess> open(const std::string &path, HeapfileError *error = nullptr) {
-        auto process = std::make_unique<OpenHeapfileProcess>();
-        if (!process->initWithHeapfile(path, error)) {
-            return nullptr;
-        }
-        return process;
-    }
-    using VSHeapfileProcess::_regionInfoForHeapfileRegion;
-    using VSHeapfileProcess::enumerateRegions;
-};
 
 }  // namespace vs::testing
