@@ -1,11 +1,10 @@
 #pragma once
 
 // Targets that hand over prepared regions when gathered, and a driver run
-// that captures the text report, so a test states exactly the figures the
-// analysis and the report see.
+// over them, so a test states exactly the figures the report sees.
 
-#include <cstdio>
-#include <cstdlib>
+#include <gtest/gtest.h>
+
 #include <functional>
 #include <memory>
 #include <string>
@@ -24,44 +23,29 @@ struct RegionSpec {
     std::string name = "";
     std::uint64_t objectId = 0;
     std::uint64_t start = 0;  // 0: the next free 16 MiB slot
-    std::uint64_t dirty = 0;
-    std::uint64_t swapped = 0;
-    std::uint64_t clean = 0;
-    std::uint64_t reclaimable = 0;
-    std::uint64_t wired = 0;
+    std::uint64_t size = 16 * MiB;
+    std::uint64_t dirty = 0, swapped = 0, clean = 0, reclaimable = 0, wired = 0;
     VSSegmentKind segment = VSSegmentNone;
     std::uint8_t shareMode = vs::kShareModePrivate;
     std::uint64_t offset = 0;
-    bool inSharedCache = false;
-    bool purgeableNonVolatile = false;
+    bool inSharedCache = false, purgeableNonVolatile = false;
 };
 
 class PreparedProcess : public VSProcess {
 public:
     PreparedProcess(std::int32_t pid, const std::string &name, std::uint64_t pageSize, bool is64) {
-        setPid(pid);
-        setName(name);
-        setDisplayString(name + " [" + std::to_string(pid) + "]");
-        setPageSize(pageSize);
-        setIs64bit(is64);
+        setPid(pid), setName(name), setDisplayString(name + " [" + std::to_string(pid) + "]");
+        setPageSize(pageSize), setIs64bit(is64);
     }
 
-    PreparedProcess &region(const RegionSpec &shape) {
+    PreparedProcess &region(const RegionSpec &s) {
         auto r = std::make_unique<VSMemoryRegion>();
-        r->setName(shape.name);
-        r->setObject_id(shape.objectId);
-        r->setStart(shape.start != 0 ? shape.start : 16 * MiB * (_prepared.size() + 1));
-        r->setSize(16 * MiB);
-        r->setDirtySize(shape.dirty);
-        r->setSwappedSize(shape.swapped);
-        r->setCleanNonSpecSize(shape.clean);
-        r->setReclaimableSize(shape.reclaimable);
-        r->setWiredSize(shape.wired);
-        r->setSegment(shape.segment);
-        r->setShare_mode(shape.shareMode);
-        r->setOffset(shape.offset);
-        r->setInSharedCache(shape.inSharedCache);
-        r->setPurgeableNonVolatile(shape.purgeableNonVolatile);
+        r->setName(s.name), r->setObject_id(s.objectId), r->setSize(s.size);
+        r->setStart(s.start != 0 ? s.start : 16 * MiB * (_prepared.size() + 1));
+        r->setDirtySize(s.dirty), r->setSwappedSize(s.swapped), r->setCleanNonSpecSize(s.clean);
+        r->setReclaimableSize(s.reclaimable), r->setWiredSize(s.wired);
+        r->setSegment(s.segment), r->setShare_mode(s.shareMode), r->setOffset(s.offset);
+        r->setInSharedCache(s.inSharedCache), r->setPurgeableNonVolatile(s.purgeableNonVolatile);
         _prepared.push_back(std::move(r));
         return *this;
     }
@@ -71,9 +55,7 @@ public:
     // Runs inside the target's gathering, on its worker.
     PreparedProcess &onGather(std::function<void()> action) { return _onGather = std::move(action), *this; }
 
-    bool gathered() const { return _gathered; }
     void gatherData() override {
-        _gathered = true;
         if (_onGather) {
             _onGather();
         }
@@ -85,38 +67,16 @@ private:
     VSMemoryRegionList _prepared;
     std::shared_ptr<const VSAuxDataDictionary> _aux;
     std::function<void()> _onGather;
-    bool _gathered = false;
 };
 
-// Collects what is written to a stdio stream.
-class CapturedStream {
-public:
-    CapturedStream() : _stream(open_memstream(&_buffer, &_length)) {}
-    ~CapturedStream() {
-        std::fclose(_stream);
-        std::free(_buffer);
-    }
-    std::FILE *stream() const { return _stream; }
-    std::string text() {
-        std::fflush(_stream);
-        return std::string(_buffer, _length);
-    }
-
-private:
-    char *_buffer = nullptr;
-    std::size_t _length = 0;
-    std::FILE *_stream;
-};
-
-// Lets a test choose the number of gathering workers: with one, the start
-// order of the targets is observable.
+// With one gathering worker the start order of the targets is observable.
 class TestVestage : public VSVestage {
 public:
     using VSVestage::VSVestage;
     using VSVestage::_setGatherWidth;
 };
 
-// One run over prepared targets, with the test double as platform (the
+// One run over prepared targets with the test double as platform (the
 // breakdown switch is one of its settings).
 class ReportRun {
 public:
@@ -128,30 +88,26 @@ public:
         _targets.push_back(std::make_unique<PreparedProcess>(pid, name, pageSize, is64));
         return static_cast<PreparedProcess &>(*_targets.back());
     }
-
-    // The driver over the targets added so far, not yet gathered.
-    TestVestage &build(unsigned width = 0) {
+    TestVestage &gather(unsigned width = 0) {
         vestage = std::make_unique<TestVestage>(std::move(_targets));
         vestage->_setGatherWidth(width);
-        return *vestage;
-    }
-    TestVestage &gather(unsigned width = 0) {
-        if (!vestage) {
-            build(width);
-        }
         vestage->gatherData();
         return *vestage;
     }
-    // Gathers unless done already, then prints the whole text report.
-    std::string report(std::int64_t format = VSSummaryFormatFormatted, std::int64_t options = 0) {
+    // Gathers unless done already; the text report as printed to standard
+    // output (where the breakdown note goes too), after any `more` formatters.
+    std::string report(std::int64_t format = VSSummaryFormatFormatted, std::int64_t options = 0,
+                       std::unique_ptr<VSOutputFormatter> more = nullptr) {
         if (!vestage) {
             gather();
         }
-        auto text = std::make_unique<VSOutputFormatterText>(format, options);
-        text->setOutput(_output.stream());
-        vestage->addOutputFormatter(std::move(text));
+        vestage->addOutputFormatter(std::make_unique<VSOutputFormatterText>(format, options));
+        if (more) {
+            vestage->addOutputFormatter(std::move(more));
+        }
+        testing::internal::CaptureStdout();
         vestage->printOutputVerbose(false, false);
-        return _output.text();
+        return testing::internal::GetCapturedStdout();
     }
 
     VSFakePlatform fake;
@@ -160,9 +116,53 @@ public:
 private:
     std::unique_ptr<VSFakePlatform::Installation> _installed;
     std::vector<std::unique_ptr<VSProcess>> _targets;
-    CapturedStream _output;
 };
 
 inline std::string rule(std::size_t width = 70) { return std::string(width, '=') + "\n"; }
+
+// MALLOC_SMALL: 8 MiB dirty and 1 MiB swapped in two regions; stack: 64 KiB
+// dirty, 16 KiB clean and 16 KiB wired in three; 16 KiB pages.
+inline PreparedProcess &addDaemon(ReportRun &run) {
+    return run.process(42, "daemon")
+        .region({.name = "MALLOC_SMALL", .objectId = 1, .dirty = 4 * MiB, .swapped = 512 * KiB})
+        .region({.name = "MALLOC_SMALL", .objectId = 2, .dirty = 4 * MiB, .swapped = 512 * KiB})
+        .region({.name = "stack", .objectId = 3, .dirty = 64 * KiB})
+        .region({.name = "stack", .objectId = 4, .clean = 16 * KiB, .wired = 16 * KiB})
+        .region({.name = "stack", .objectId = 5});
+}
+
+inline const std::string kDaemonFormatted = rule() +
+                                            "daemon [42]: 64-bit\tVestage: 9280 KB (16384 bytes per page)\n" +
+                                            rule() +
+                                            "\n"
+                                            "  Dirty      Clean  Reclaimable    Regions    Category\n"
+                                            "    ---        ---          ---        ---    ---\n"
+                                            "9216 KB        0 B          0 B          2    MALLOC_SMALL\n"
+                                            "  64 KB      16 KB          0 B          3    stack\n"
+                                            "    ---        ---          ---        ---    ---\n"
+                                            "9280 KB      16 KB          0 B          5    TOTAL\n"
+                                            "\n";
+
+// The daemon with auxiliary data, a failed worker (its memory counts in the
+// summary, its auxiliary data does not) and a warned 32-bit tool; the
+// breakdown switch on.
+inline void addTroubledRun(ReportRun &run) {
+    using vs::makeAuxData, vs::makeAuxDictionary;
+    run.fake.setting("vm.self_region_vestage", 1);
+    addDaemon(run).aux(makeAuxDictionary({
+        {"Kernel memory", makeAuxDictionary({{"KPRVT", makeAuxData(16384, true)},
+                                             {"deeper", makeAuxDictionary({{"x", makeAuxData(0, true)}})}})},
+        {"phys_vestage", makeAuxData(10000, false)},
+    }));
+    run.process(7, "worker")
+        .region({.name = "MALLOC_SMALL", .objectId = 11, .dirty = 8 * MiB})
+        .region({.name = "stack", .objectId = 13, .dirty = 64 * KiB})
+        .region({.name = "stack", .objectId = 14, .clean = 16 * KiB})
+        .aux(makeAuxDictionary({{"Kernel memory", makeAuxDictionary({{"KPRVT", makeAuxData(1 << 20, true)}})}}))
+        .error("worker [7]: task is gone");
+    run.process(5, "tool", 16384, false)
+        .region({.name = "stack", .objectId = 21, .dirty = 16 * KiB})
+        .warning("tool [5]: (zombie)");
+}
 
 } // namespace report_test
