@@ -116,11 +116,7 @@ void VSVestage::_addProcess(VSProcess &process) {
         }
         VSMemoryObject *object;
         if (key != 0) {
-            std::unique_ptr<VSMemoryObject> &slot = (*table)[key];
-            if (!slot) {
-                slot = std::make_unique<VSMemoryObject>();
-            }
-            object = slot.get();
+            object = &table->objectFor(key);
         } else {
             _uniqueMemoryObjects.push_back(std::make_unique<VSMemoryObject>());
             object = _uniqueMemoryObjects.back().get();
@@ -133,16 +129,16 @@ void VSVestage::_addProcess(VSProcess &process) {
 void VSVestage::calculateSizes() {
     for (const MemoryObjectTable *table :
          {&_memoryObjects, &_kernelMemoryObjects, &_sharedCache32MemoryObjects, &_sharedCache64MemoryObjects}) {
-        for (const auto &entry : *table) {
-            entry.second->calculateSizes();
+        for (const std::unique_ptr<VSMemoryObject> &object : table->objects()) {
+            object->calculateSizes();
         }
     }
     for (const std::unique_ptr<VSMemoryObject> &object : _uniqueMemoryObjects) {
         object->calculateSizes();
     }
     for (const MemoryObjectTable *table : {&_textMemoryObjects, &_linkeditMemoryObjects}) {
-        for (const auto &entry : *table) {
-            entry.second->calculateSizes();
+        for (const std::unique_ptr<VSMemoryObject> &object : table->objects()) {
+            object->calculateSizes();
         }
     }
 }
@@ -417,24 +413,26 @@ std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
 }
 
 void VSVestage::_releaseMemoryObjectsTo(VSVestageSharingData &sharing) {
-    const std::initializer_list<MemoryObjectTable *> tables = {
-        &_memoryObjects,      &_kernelMemoryObjects, &_sharedCache64MemoryObjects, &_sharedCache32MemoryObjects,
-        &_textMemoryObjects, &_linkeditMemoryObjects};
-    // The list of unique objects is handed over whole, with the tables'
-    // objects appended to it in one step.
-    MemoryObjectList objects = std::move(_uniqueMemoryObjects);
-    _uniqueMemoryObjects.clear();
-    std::size_t count = objects.size();
+    // The ordinary collection holds nearly every object of a live run: its
+    // list is handed over whole, with the others appended in one step.
+    MemoryObjectList objects = _memoryObjects.release();
+    const std::initializer_list<MemoryObjectTable *> tables = {&_kernelMemoryObjects, &_sharedCache64MemoryObjects,
+                                                               &_sharedCache32MemoryObjects, &_textMemoryObjects,
+                                                               &_linkeditMemoryObjects};
+    std::size_t count = objects.size() + _uniqueMemoryObjects.size();
     for (const MemoryObjectTable *table : tables) {
         count += table->size();
     }
     objects.reserve(count);
     for (MemoryObjectTable *table : tables) {
-        for (auto &entry : *table) {
-            objects.push_back(std::move(entry.second));
+        for (std::unique_ptr<VSMemoryObject> &object : table->release()) {
+            objects.push_back(std::move(object));
         }
-        table->clear();
     }
+    for (std::unique_ptr<VSMemoryObject> &object : _uniqueMemoryObjects) {
+        objects.push_back(std::move(object));
+    }
+    _uniqueMemoryObjects.clear();
     sharing.adoptMemoryObjects(std::move(objects));
 }
 

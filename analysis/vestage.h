@@ -33,6 +33,7 @@
 
 #include "analysis/categories.h"
 #include "analysis/interrupt_source.h"
+#include "analysis/object_table.h"
 #include "analysis/sharing.h"
 #include "model/memory_object.h"
 #include "output/output_formatter.h"
@@ -40,7 +41,7 @@
 
 class VSVestage {
 public:
-    using MemoryObjectTable = std::unordered_map<std::uint64_t, std::unique_ptr<VSMemoryObject>>;
+    using MemoryObjectTable = vs::MemoryObjectTable;
     using MemoryObjectList = std::vector<std::unique_ptr<VSMemoryObject>>;
 
     // The driver owns the targets, in the order given.

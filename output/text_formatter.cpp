@@ -22,23 +22,26 @@ std::uint64_t pagesOf(std::uint64_t bytes, std::uint64_t pageSize) {
 VSOutputFormatterText::VSOutputFormatterText(std::int64_t summaryFormat, std::int64_t options)
     : _summaryFormat(summaryFormat), _options(options), _output(stdout) {}
 
-std::string VSOutputFormatterText::formattedStringForSize(std::uint64_t size) const {
-    char buffer[32];
+const char *VSOutputFormatterText::_formatSize(std::uint64_t size, char (&buffer)[32]) const {
     switch (_summaryFormat) {
-    case VSSummaryFormatFormatted: {
+    case VSSummaryFormatFormatted:
         // Eight bytes leave room for at most four digits before the prefix.
-        char scaled[8] = {};
-        humanize_number(scaled, sizeof scaled, static_cast<std::int64_t>(size), "B", HN_AUTOSCALE, 0);
-        return scaled;
-    }
+        buffer[0] = '\0';
+        humanize_number(buffer, 8, static_cast<std::int64_t>(size), "B", HN_AUTOSCALE, 0);
+        break;
     case VSSummaryFormatPages:
-        std::snprintf(buffer, sizeof buffer, "%llu pages",
-                      static_cast<unsigned long long>(pagesOf(size, _pageSize)));
-        return buffer;
+        std::snprintf(buffer, sizeof buffer, "%llu pages", static_cast<unsigned long long>(pagesOf(size, _pageSize)));
+        break;
     default:
         std::snprintf(buffer, sizeof buffer, "%lld B", static_cast<long long>(size));
-        return buffer;
+        break;
     }
+    return buffer;
+}
+
+std::string VSOutputFormatterText::formattedStringForSize(std::uint64_t size) const {
+    char buffer[32];
+    return _formatSize(size, buffer);
 }
 
 bool VSOutputFormatterText::implementsOperation(VSOptionalFormatterOperation) const { return true; }
@@ -85,13 +88,19 @@ void VSOutputFormatterText::_printSeparatorRow() {
 void VSOutputFormatterText::_printRow(std::uint64_t dirtyAndSwapped, std::uint64_t swapped, std::uint64_t clean,
                                       std::uint64_t reclaimable, std::uint64_t wired, std::int64_t regions,
                                       const char *label) {
+    // A report has a row per category per table: the figures are formatted
+    // into buffers on the stack rather than strings.
     const ColumnWidths w = _columnWidths();
-    const std::string swappedText = _showsSwapped() ? formattedStringForSize(swapped) : "";
-    const std::string wiredText = _showsWired() ? formattedStringForSize(wired) : "";
-    std::fprintf(_output, "%*s%*s%*s%*s%*s %10d    %s\n", w.dirty, formattedStringForSize(dirtyAndSwapped).c_str(),
-                 w.swapped, swappedText.c_str(), w.clean, formattedStringForSize(clean).c_str(), w.reclaimable,
-                 formattedStringForSize(reclaimable).c_str(), w.wired, wiredText.c_str(),
-                 static_cast<int>(regions), label);
+    char dirtyText[32], swappedText[32] = "", cleanText[32], reclaimableText[32], wiredText[32] = "";
+    if (_showsSwapped()) {
+        _formatSize(swapped, swappedText);
+    }
+    if (_showsWired()) {
+        _formatSize(wired, wiredText);
+    }
+    std::fprintf(_output, "%*s%*s%*s%*s%*s %10d    %s\n", w.dirty, _formatSize(dirtyAndSwapped, dirtyText), w.swapped,
+                 swappedText, w.clean, _formatSize(clean, cleanText), w.reclaimable,
+                 _formatSize(reclaimable, reclaimableText), w.wired, wiredText, static_cast<int>(regions), label);
 }
 
 void VSOutputFormatterText::_printCategories(const VSCategoryTable &categories,

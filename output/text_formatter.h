@@ -68,6 +68,8 @@ private:
     bool _showsSwapped() const { return (_options & VSOutputOptionSwapped) != 0; }
     bool _showsWired() const { return (_options & VSOutputOptionWired) != 0; }
     ColumnWidths _columnWidths() const;
+    // formattedStringForSize into a buffer of the caller's; returns it.
+    const char *_formatSize(std::uint64_t size, char (&buffer)[32]) const;
 
     // The "=" rule; closing adds an empty line after it.
     void _printRule(bool closing);
