@@ -3,7 +3,10 @@
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
+#include <new>
+#include <sys/mman.h>
 #include <unistd.h>
+#include <utility>
 
 namespace vs {
 
@@ -14,12 +17,39 @@ constexpr size_t kInitialBuffer = 256 * 1024;
 
 } // namespace
 
+ReadBuffer::ReadBuffer(ReadBuffer &&other) noexcept
+    : _data(std::exchange(other._data, nullptr)), _capacity(std::exchange(other._capacity, 0)) {}
+
+ReadBuffer &ReadBuffer::operator=(ReadBuffer &&other) noexcept {
+    if (this != &other) {
+        if (_data != nullptr) {
+            ::munmap(_data, _capacity);
+        }
+        _data = std::exchange(other._data, nullptr);
+        _capacity = std::exchange(other._capacity, 0);
+    }
+    return *this;
+}
+
+ReadBuffer::~ReadBuffer() {
+    if (_data != nullptr) {
+        ::munmap(_data, _capacity);
+    }
+}
+
 void ReadBuffer::reserve(size_t bytes) {
     if (bytes <= _capacity) {
         return;
     }
-    auto grown = std::make_unique_for_overwrite<char[]>(bytes);
-    _data = std::move(grown);
+    const size_t page = static_cast<size_t>(::sysconf(_SC_PAGESIZE));
+    bytes = (bytes + page - 1) / page * page;
+    void *grown = _data == nullptr
+                      ? ::mmap(nullptr, bytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0)
+                      : ::mremap(_data, _capacity, bytes, MREMAP_MAYMOVE);
+    if (grown == MAP_FAILED) {
+        throw std::bad_alloc();
+    }
+    _data = static_cast<char *>(grown);
     _capacity = bytes;
 }
 
@@ -35,11 +65,7 @@ int readAll(int fd, ReadBuffer &buffer, std::string_view &text) {
     size_t used = 0;
     for (;;) {
         if (used == buffer.capacity()) {
-            // Keep what was read: growing must not lose the first part.
-            ReadBuffer bigger;
-            bigger.reserve(buffer.capacity() * 2);
-            std::memcpy(bigger.data(), buffer.data(), used);
-            buffer = std::move(bigger);
+            buffer.reserve(buffer.capacity() * 2); // keeps what was read
         }
         const ssize_t n = ::pread(fd, buffer.data() + used, buffer.capacity() - used,
                                   static_cast<off_t>(used));

@@ -15,14 +15,26 @@
 
 namespace vs {
 
+// Memory for whole-file reads. It is mapped from the kernel directly and
+// grows by remapping, which keeps what was read without copying it and
+// touches no page the file does not fill (a symbol table of several
+// megabytes would otherwise be copied and faulted in at every doubling).
 class ReadBuffer {
 public:
-    char *data() { return _data.get(); }
+    ReadBuffer() = default;
+    ReadBuffer(ReadBuffer &&other) noexcept;
+    ReadBuffer &operator=(ReadBuffer &&other) noexcept;
+    ReadBuffer(const ReadBuffer &) = delete;
+    ReadBuffer &operator=(const ReadBuffer &) = delete;
+    ~ReadBuffer();
+
+    char *data() { return _data; }
     size_t capacity() const { return _capacity; }
+    // Grows to at least `bytes`, keeping the contents.
     void reserve(size_t bytes);
 
 private:
-    std::unique_ptr<char[]> _data;
+    char *_data = nullptr;
     size_t _capacity = 0;
 };
 
