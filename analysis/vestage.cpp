@@ -244,16 +244,18 @@ VSCategoryTable VSVestage::_summarizedCategoriesForCategories(VSCategoryTable ca
 }
 
 VSSortedCategoryKeys VSVestage::_sortedKeysForCategories(const VSCategoryTable &categories) {
-    VSSortedCategoryKeys keys;
-    keys.reserve(categories.size());
+    // The entries are sorted, not their names: comparing through the table
+    // would look both names up again for every comparison.
+    std::vector<const VSCategoryTable::value_type *> entries;
+    entries.reserve(categories.size());
     for (const auto &entry : categories) {
-        keys.push_back(entry.first);
+        entries.push_back(&entry);
     }
     // The table iterates in name order and the sort is stable, so equal
     // categories stay in name order.
-    std::stable_sort(keys.begin(), keys.end(), [&](const std::string &a, const std::string &b) {
-        const VSMemoryCategory &x = categories.at(a);
-        const VSMemoryCategory &y = categories.at(b);
+    std::stable_sort(entries.begin(), entries.end(), [](const auto *a, const auto *b) {
+        const VSMemoryCategory &x = a->second;
+        const VSMemoryCategory &y = b->second;
         const std::uint64_t dirtyX = x.totalDirtySize() + x.totalSwappedSize();
         const std::uint64_t dirtyY = y.totalDirtySize() + y.totalSwappedSize();
         if (dirtyX != dirtyY) {
@@ -264,6 +266,11 @@ VSSortedCategoryKeys VSVestage::_sortedKeysForCategories(const VSCategoryTable &
         }
         return x.totalCleanSize() > y.totalCleanSize();
     });
+    VSSortedCategoryKeys keys;
+    keys.reserve(entries.size());
+    for (const auto *entry : entries) {
+        keys.push_back(entry->first);
+    }
     return keys;
 }
 

@@ -2,6 +2,8 @@
 
 #include <bsd/libutil.h>
 
+#include <cstring>
+
 #include "analysis/vestage.h"
 #include "model/assert.h"
 #include "model/aux_data.h"
@@ -24,11 +26,18 @@ VSOutputFormatterText::VSOutputFormatterText(std::int64_t summaryFormat, std::in
 
 const char *VSOutputFormatterText::_formatSize(std::uint64_t size, char (&buffer)[32]) const {
     switch (_summaryFormat) {
-    case VSSummaryFormatFormatted:
-        // Eight bytes leave room for at most four digits before the prefix.
-        buffer[0] = '\0';
-        humanize_number(buffer, 8, static_cast<std::int64_t>(size), "B", HN_AUTOSCALE, 0);
+    case VSSummaryFormatFormatted: {
+        SizeText &known = _sizeTexts[(size ^ (size >> 12) ^ (size >> 24)) % _sizeTexts.size()];
+        if (!known.known || known.size != size) {
+            // Eight bytes leave room for at most four digits before the prefix.
+            known.text[0] = '\0';
+            humanize_number(known.text, sizeof known.text, static_cast<std::int64_t>(size), "B", HN_AUTOSCALE, 0);
+            known.size = size;
+            known.known = true;
+        }
+        std::memcpy(buffer, known.text, sizeof known.text);
         break;
+    }
     case VSSummaryFormatPages:
         std::snprintf(buffer, sizeof buffer, "%llu pages", static_cast<unsigned long long>(pagesOf(size, _pageSize)));
         break;

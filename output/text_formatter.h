@@ -6,6 +6,7 @@
 // printed last (the summary too, which therefore uses the last process's
 // page size).
 
+#include <array>
 #include <cstdint>
 #include <cstdio>
 #include <string>
@@ -84,6 +85,16 @@ private:
     void printAuxData(const VSAuxDataDictionary &auxData);
     void _printAuxData(const VSAuxDataDictionary &auxData, std::uint32_t indent);
     void _printPhysVestageBreakdownEnabled();
+
+    // Humanized sizes already worked out: a report repeats a few figures
+    // (0 B, a page, ...) in most of its rows, and each text takes the
+    // library a thousand instructions and more.
+    struct SizeText {
+        std::uint64_t size = 0;
+        bool known = false;
+        char text[8] = {};
+    };
+    mutable std::array<SizeText, 256> _sizeTexts{};
 
     std::int32_t _processCount = 0;
     std::uint64_t _pageSize = 0;
