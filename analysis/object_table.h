@@ -22,7 +22,11 @@ public:
     // The object filed under `key`, created empty on first use.
     VSMemoryObject &objectFor(std::uint64_t key) {
         if ((_keys.size() + 1) * 2 > _slots.size()) {
-            _rebuild(std::max<std::size_t>(64, _slots.size() * 2));
+            std::size_t slots = std::max<std::size_t>(64, _slots.size() * 2);
+            while (slots < (_keys.size() + 1) * 2) {
+                slots *= 2;
+            }
+            _rebuild(slots);
         }
         const std::size_t mask = _slots.size() - 1;
         std::size_t i = _slotFor(key, mask);
@@ -61,6 +65,10 @@ public:
         clear();
         return objects;
     }
+
+    // Gives the index back once no more objects are looked up (it is built
+    // again by the next lookup): the objects stay.
+    void dropIndex() { std::vector<std::uint32_t>().swap(_slots); }
 
     void clear() {
         _objects.clear();

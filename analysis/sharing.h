@@ -30,13 +30,17 @@ namespace vs {
 // equal.
 struct ProcessGroupLess {
     bool operator()(const VSProcessGroup &a, const VSProcessGroup &b) const;
+    bool operator()(const VSProcessGroup *a, const VSProcessGroup *b) const { return (*this)(*a, *b); }
 };
 
 } // namespace vs
 
 class VSVestageSharingData {
 public:
-    using ProcessGroups = std::set<VSProcessGroup, vs::ProcessGroupLess>;
+    // A target's groups, in group order. Each group is stored once, as a key
+    // of processGroupToObjects, and pointed to from here: a group of a few
+    // hundred targets is not copied for every one of its members.
+    using ProcessGroups = std::set<const VSProcessGroup *, vs::ProcessGroupLess>;
     // Keyed by the target's asNumber (its pid).
     using ProcessToProcessGroups = std::map<std::int64_t, ProcessGroups>;
     // The objects whose group is exactly the key, in the order first met.
@@ -45,6 +49,8 @@ public:
     const ProcessToProcessGroups &processToProcessGroups() const { return _processToProcessGroups; }
     void setProcessToProcessGroups(ProcessToProcessGroups value) { _processToProcessGroups = std::move(value); }
 
+    // Moving the map keeps its keys where they are, so the pointers of
+    // processToProcessGroups stay valid when both are set together.
     const ProcessGroupToObjects &processGroupToObjects() const { return _processGroupToObjects; }
     void setProcessGroupToObjects(ProcessGroupToObjects value) { _processGroupToObjects = std::move(value); }
 

@@ -81,6 +81,12 @@ void VSVestage::gatherData() {
     for (const std::unique_ptr<VSProcess> &process : _processes) {
         _addProcess(*process);
     }
+    // Filing is done: the indexes of the collections are not needed while
+    // the report holds everything else.
+    for (MemoryObjectTable *table : {&_memoryObjects, &_kernelMemoryObjects, &_sharedCache64MemoryObjects,
+                                     &_sharedCache32MemoryObjects, &_textMemoryObjects, &_linkeditMemoryObjects}) {
+        table->dropIndex();
+    }
     calculateSizes();
     _buildProcessToVestageMap();
 }
@@ -331,12 +337,19 @@ std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
     vs::PointerSet<VSMemoryObject> objects;
     std::vector<Members> membersOfObject;
     std::vector<VSProcessGroup> lists;
-    std::size_t regionCount = 0;
-    for (const std::unique_ptr<VSProcess> &process : _processes) {
-        regionCount += process->memoryRegions().size();
+    // Room for every object (at most one per region) once, not by growing.
+    std::size_t objectCount = _uniqueMemoryObjects.size();
+    for (const MemoryObjectTable *table : {&_memoryObjects, &_kernelMemoryObjects, &_sharedCache64MemoryObjects,
+                                           &_sharedCache32MemoryObjects, &_textMemoryObjects, &_linkeditMemoryObjects}) {
+        objectCount += table->size();
     }
-    objects.reserve(regionCount);
-    membersOfObject.reserve(regionCount);
+    if (objectCount == 0) {
+        for (const std::unique_ptr<VSProcess> &process : _processes) {
+            objectCount += process->memoryRegions().size();
+        }
+    }
+    objects.reserve(objectCount);
+    membersOfObject.reserve(objectCount);
     // With distinct pids (every live run) a target that is already a member
     // of a group was the last one added, since targets are visited one after
     // another: no search through the members is needed.
@@ -389,7 +402,7 @@ std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
         auto [entry, newGroup] = processGroupToObjects.try_emplace(group);
         if (newGroup) {
             for (const VSProcess *member : group) {
-                processToProcessGroups[member->asNumber()].insert(group);
+                processToProcessGroups[member->asNumber()].insert(&entry->first);
             }
         }
         return entry->second;
@@ -523,11 +536,11 @@ void VSVestage::printOutputVerbose(bool verbose, bool summarize) {
         std::vector<const VSProcessGroup *> groups;
         auto found = sharing->processToProcessGroups().find(process->asNumber());
         if (found != sharing->processToProcessGroups().end()) {
-            for (const VSProcessGroup &group : found->second) {
-                if (group.size() == 1) {
-                    groups.insert(groups.begin(), &group);
+            for (const VSProcessGroup *group : found->second) {
+                if (group->size() == 1) {
+                    groups.insert(groups.begin(), group);
                 } else {
-                    groups.push_back(&group);
+                    groups.push_back(group);
                 }
             }
         }
