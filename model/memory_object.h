@@ -21,12 +21,16 @@
 #include <string>
 #include <utility>
 
+#include "model/block_pool.h"
 #include "model/memory_region.h"
 #include "model/pointer_set.h"
 
 // One disjoint range of the object's offset space with the bytes of each
 // page class attributed to it.
 struct VSRangeListNode {
+    static void *operator new(std::size_t size) { return vs::BlockPool<VSRangeListNode>::allocate(size); }
+    static void operator delete(void *p, std::size_t size) { vs::BlockPool<VSRangeListNode>::deallocate(p, size); }
+
     std::uint64_t offset = 0;
     std::uint64_t size = 0; // exact, not rounded to pages
     std::uint64_t cleanSize = 0;
@@ -43,6 +47,11 @@ using RegionSet = PointerSet<VSMemoryRegion>;
 
 class VSMemoryObject {
 public:
+    // Most regions of a run get an object of their own: they, and their
+    // range-list nodes, come from pools.
+    static void *operator new(std::size_t size) { return vs::BlockPool<VSMemoryObject>::allocate(size); }
+    static void operator delete(void *p, std::size_t size) { vs::BlockPool<VSMemoryObject>::deallocate(p, size); }
+
     VSMemoryObject() = default;
     ~VSMemoryObject();
     VSMemoryObject(const VSMemoryObject &) = delete;

@@ -20,6 +20,8 @@
 #include <string>
 #include <string_view>
 
+#include "model/block_pool.h"
+
 class VSMemoryObject;
 
 // Which kind of image segment a range belongs to. Kinds 2 to 4 are the
@@ -34,6 +36,10 @@ enum VSSegmentKind : std::uint8_t {
 
 class VSMemoryRegion {
 public:
+    // A run makes one per mapping of every target: they come from a pool.
+    static void *operator new(std::size_t size) { return vs::BlockPool<VSMemoryRegion>::allocate(size); }
+    static void operator delete(void *p, std::size_t size) { vs::BlockPool<VSMemoryRegion>::deallocate(p, size); }
+
     VSMemoryRegion() = default;
     // Copies every property, memoryObject included (gatherers clone a
     // region before cutting it into pieces).

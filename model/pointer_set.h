@@ -6,13 +6,15 @@
 // the same thing, which a hash set would not.
 //
 // A run holds one set per memory object, and most objects have a single
-// region: a set of one keeps its member inline, with no allocation. Small
-// sets are searched linearly; once a set grows past that, an open-addressing
-// index of the members (a flat table, no node per member) is built beside
-// them.
+// region: a set of one keeps its member inline, with no allocation, and the
+// whole set is two words. Larger sets keep their members in a list beside
+// it; small ones are searched linearly, and once a set grows past that an
+// open-addressing index of the members (a flat table, no node per member)
+// is built.
 
 #include <cstddef>
 #include <cstdint>
+#include <memory>
 #include <span>
 #include <utility>
 #include <vector>
@@ -26,6 +28,26 @@ class PointerSet {
 public:
     using const_iterator = T *const *;
 
+    PointerSet() = default;
+    PointerSet(const PointerSet &other)
+        : _one(other._one), _large(other._large ? std::make_unique<Large>(*other._large) : nullptr) {}
+    PointerSet &operator=(const PointerSet &other) {
+        if (this != &other) {
+            _one = other._one;
+            _large = other._large ? std::make_unique<Large>(*other._large) : nullptr;
+        }
+        return *this;
+    }
+    PointerSet(PointerSet &&other) noexcept
+        : _one(std::exchange(other._one, nullptr)), _large(std::move(other._large)) {}
+    PointerSet &operator=(PointerSet &&other) noexcept {
+        if (this != &other) {
+            _one = std::exchange(other._one, nullptr);
+            _large = std::move(other._large);
+        }
+        return *this;
+    }
+
     // Adds p unless it is already present. Returns true when it was added.
     bool insert(T *p) { return insertIndex(p).second; }
 
@@ -36,24 +58,21 @@ public:
         if (const std::size_t found = indexOf(p); found != kNotFound) {
             return {found, false};
         }
-        if (_more.empty() && _slots.empty() && _one == nullptr) {
+        if (!_large && _one == nullptr) {
             _one = p;
             return {0, true};
         }
-        if (_more.empty() && _one != nullptr) {
-            _more.reserve(4);
-            _more.push_back(_one);
-        }
-        _more.push_back(p);
-        const std::size_t index = _more.size() - 1;
-        if (!_slots.empty()) {
-            if (_more.size() * 2 > _slots.size()) {
-                _rebuildIndex(_slots.size() * 2);
+        Large &large = _makeLarge(4);
+        large.items.push_back(p);
+        const std::size_t index = large.items.size() - 1;
+        if (!large.slots.empty()) {
+            if (large.items.size() * 2 > large.slots.size()) {
+                large.rebuildIndex(large.slots.size() * 2);
             } else {
-                _place(index);
+                large.place(index);
             }
-        } else if (_more.size() > kLinearLimit) {
-            _rebuildIndex(64);
+        } else if (large.items.size() > kLinearLimit) {
+            large.rebuildIndex(64);
         }
         return {index, true};
     }
@@ -62,14 +81,15 @@ public:
 
     // p's position in the order of first addition, or kNotFound.
     std::size_t indexOf(const T *p) const {
-        if (!_slots.empty()) {
-            const std::size_t mask = _slots.size() - 1;
+        if (_large && !_large->slots.empty()) {
+            const std::vector<std::uint32_t> &slots = _large->slots;
+            const std::size_t mask = slots.size() - 1;
             for (std::size_t i = _slotFor(p, mask);; i = (i + 1) & mask) {
-                const std::uint32_t slot = _slots[i];
+                const std::uint32_t slot = slots[i];
                 if (slot == 0) {
                     return kNotFound;
                 }
-                if (_more[slot - 1] == p) {
+                if (_large->items[slot - 1] == p) {
                     return slot - 1;
                 }
             }
@@ -95,14 +115,12 @@ public:
         while (slots < count * 2) {
             slots *= 2;
         }
-        if (slots <= _slots.size()) {
+        if (_large && slots <= _large->slots.size()) {
             return;
         }
-        if (_more.empty() && _one != nullptr) {
-            _more.push_back(_one);
-        }
-        _more.reserve(count);
-        _rebuildIndex(slots);
+        Large &large = _makeLarge(count);
+        large.items.reserve(count);
+        large.rebuildIndex(slots);
     }
 
     // Adds every member of other, keeping other's order for the new ones.
@@ -112,9 +130,9 @@ public:
         }
     }
 
-    std::size_t size() const { return _more.empty() ? (_one != nullptr ? 1 : 0) : _more.size(); }
+    std::size_t size() const { return _large ? _large->items.size() : (_one != nullptr ? 1 : 0); }
     bool empty() const { return size() == 0; }
-    const_iterator begin() const { return _more.empty() ? &_one : _more.data(); }
+    const_iterator begin() const { return _large ? _large->items.data() : &_one; }
     const_iterator end() const { return begin() + size(); }
     // The members in the order they were first added.
     std::span<T *const> items() const { return {begin(), size()}; }
@@ -127,29 +145,45 @@ private:
         return static_cast<std::size_t>(((bits >> 3) * 0x9E3779B97F4A7C15ull) >> 32) & mask;
     }
 
-    void _place(std::size_t index) {
-        const std::size_t mask = _slots.size() - 1;
-        std::size_t i = _slotFor(_more[index], mask);
-        while (_slots[i] != 0) {
-            i = (i + 1) & mask;
+    // The members of a set of more than one, and their index.
+    struct Large {
+        std::vector<T *> items;
+        // Empty, or a power-of-two table at most half full: 0 is a free
+        // slot, anything else a position in items plus one.
+        std::vector<std::uint32_t> slots;
+
+        void place(std::size_t index) {
+            const std::size_t mask = slots.size() - 1;
+            std::size_t i = _slotFor(items[index], mask);
+            while (slots[i] != 0) {
+                i = (i + 1) & mask;
+            }
+            slots[i] = static_cast<std::uint32_t>(index + 1);
         }
-        _slots[i] = static_cast<std::uint32_t>(index + 1);
+
+        void rebuildIndex(std::size_t count) {
+            slots.assign(count, 0);
+            for (std::size_t index = 0; index < items.size(); ++index) {
+                place(index);
+            }
+        }
+    };
+
+    // The list of members, made on the second one (the first moves into it).
+    Large &_makeLarge(std::size_t capacity) {
+        if (!_large) {
+            _large = std::make_unique<Large>();
+            _large->items.reserve(capacity);
+            if (_one != nullptr) {
+                _large->items.push_back(_one);
+            }
+        }
+        return *_large;
     }
 
-    void _rebuildIndex(std::size_t slots) {
-        _slots.assign(slots, 0);
-        for (std::size_t index = 0; index < _more.size(); ++index) {
-            _place(index);
-        }
-    }
-
-    // The only member while there is at most one and no index; afterwards
-    // the members live in _more and _one is no longer read.
+    // The only member while there is no list; not read once there is one.
     T *_one = nullptr;
-    std::vector<T *> _more;
-    // Empty, or a power-of-two table at most half full: 0 is a free slot,
-    // anything else a position in _more plus one.
-    std::vector<std::uint32_t> _slots;
+    std::unique_ptr<Large> _large;
 };
 
 } // namespace vs

@@ -63,12 +63,17 @@ TEST(PointerSet, KeepsFirstAdditionOrderAndFindsEveryMember) {
         for (int *p : order) {
             EXPECT_TRUE(copy.contains(p));
         }
+        // A moved set takes the members and their order along.
+        vs::PointerSet<int> moved = std::move(copy);
+        ASSERT_EQ(moved.size(), order.size() + 1);
+        EXPECT_EQ(std::vector<int *>(moved.begin(), moved.end() - 1), order);
+        EXPECT_EQ(moved.indexOf(&storage[c.members]), order.size());
 
         // A union adds only what is new, in the other set's order.
         vs::PointerSet<int> merged;
         merged.insert(&storage[c.members]);
         merged.unionWith(set);
-        merged.unionWith(copy);
+        merged.unionWith(moved);
         ASSERT_EQ(merged.size(), order.size() + 1);
         EXPECT_EQ(*merged.begin(), &storage[c.members]);
         EXPECT_EQ(std::vector<int *>(merged.begin() + 1, merged.end()), order);
