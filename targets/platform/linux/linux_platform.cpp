@@ -16,6 +16,7 @@
 #include <dirent.h>
 #include <elf.h>
 #include <fcntl.h>
+#include <malloc.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -187,6 +188,14 @@ int readPidFile(int32_t pid, const char *name, std::string_view &text) {
 } // namespace
 
 VSLinuxPlatform::VSLinuxPlatform() : _pageSize(static_cast<uint64_t>(::sysconf(_SC_PAGESIZE))) {
+    // A run keeps the regions of every process until its report is printed.
+    // What the gathering threads only need for a while (parses, the kernel's
+    // tables) must go back for that: one heap for all threads, so that the
+    // report reuses what they freed instead of leaving it in arenas of their
+    // own, and large blocks mapped on their own, so that freeing one returns
+    // it (the C library would otherwise raise that limit as it goes).
+    ::mallopt(M_ARENA_MAX, 1);
+    ::mallopt(M_MMAP_THRESHOLD, 256 * 1024);
     // Every task handle holds a directory fd for the whole run, and a run
     // over all processes opens one per process: lift the soft fd limit.
     rlimit files{};
