@@ -81,6 +81,7 @@ void VSVestage::gatherData() {
     for (const std::unique_ptr<VSProcess> &process : _processes) {
         _addProcess(*process);
     }
+    _filedInProcessOrder = true;
     // Filing is done: the indexes of the collections are not needed while
     // the report holds everything else.
     for (MemoryObjectTable *table : {&_memoryObjects, &_kernelMemoryObjects, &_sharedCache64MemoryObjects,
@@ -92,6 +93,7 @@ void VSVestage::gatherData() {
 }
 
 void VSVestage::_addProcess(VSProcess &process) {
+    _filedInProcessOrder = false;
     for (const std::unique_ptr<VSMemoryRegion> &owned : process.memoryRegions()) {
         VSMemoryRegion &region = *owned;
         std::uint64_t key;
@@ -204,11 +206,19 @@ private:
 VSCategoryTable VSVestage::_categoriesForAllProcesses() const {
     VSCategoryTable table;
     CategoryFinder finder(table);
+    // An object is placed at the first region met that maps it. When the
+    // targets were filed in this same order that is the object's own first
+    // region, and no set of placed objects is needed.
     vs::PointerSet<const VSMemoryObject> placed;
     for (const std::unique_ptr<VSProcess> &process : _processes) {
         for (const std::unique_ptr<VSMemoryRegion> &region : process->memoryRegions()) {
             VSMemoryObject *object = region->memoryObject();
-            if (object == nullptr || !placed.insert(object)) {
+            if (object == nullptr) {
+                continue;
+            }
+            const bool first = _filedInProcessOrder ? *object->memoryRegions().begin() == region.get()
+                                                    : placed.insert(object);
+            if (!first) {
                 continue;
             }
             finder.categoryFor(region->sharedName(), region->segment()).addMemoryObject(object);

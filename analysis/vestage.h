@@ -149,4 +149,7 @@ private:
     std::vector<std::unique_ptr<VSOutputFormatter>> _outputFormatters;
     std::atomic<bool> _earlyExit{false};
     unsigned _gatherWidth = 0;
+    // True when every target was filed by gatherData, in processes order:
+    // then each object's first region is the first one met in that order.
+    bool _filedInProcessOrder = false;
 };
