@@ -64,7 +64,8 @@ TEST(Merging, RegionsBecomeMemoryObjectsByKey) {
     run.process(0, "kernel").region({.objectId = 0x200000005, .dirty = 1});
     run.process(2, "worker").region({.objectId = 5, .dirty = 1, .shareMode = vs::kShareModeCopyOnWrite});
     const VSVestage &v = run.gather();
-    EXPECT_NE(v.processes()[0]->memoryRegions()[0]->memoryObject(), v.processes()[1]->memoryRegions()[0]->memoryObject());
+    EXPECT_NE(v.processes()[0]->memoryRegions()[0]->memoryObject(),
+              v.processes()[1]->memoryRegions()[0]->memoryObject());
     EXPECT_EQ(v.kernelMemoryObjects().size(), 1u);
 }
 
@@ -172,8 +173,9 @@ TEST(Categories, FoldingIntoOther) {
     }
     EXPECT_EQ(foldedNames, kept);
     const VSMemoryCategory &other = folded.at("Other");
-    EXPECT_EQ(std::tuple(other.totalDirtySize(), other.totalSwappedSize(), other.totalCleanSize(), other.totalRegions()),
-              std::tuple(MiB, 512 * KiB, 4 * MiB, 5));
+    EXPECT_EQ(std::tuple(other.totalDirtySize(), other.totalSwappedSize(), other.totalCleanSize()),
+              std::tuple(MiB, 512 * KiB, 4 * MiB));
+    EXPECT_EQ(other.totalRegions(), 5);
     // Folding moves figures around; the totals stay.
     EXPECT_TRUE(plainTotals == foldedTotals);
     EXPECT_EQ(plainTotals.regions, 9u);

@@ -1,6 +1,5 @@
-// The JSON document read back and compared as parsed values (key order is
-// free), and where the write lands: a failed write leaves the previous
-// document, no debris and the text report as it was.
+// The JSON document read back as parsed values (key order is free), and
+// where the write lands; a failed one leaves everything as it was.
 
 #include <sys/wait.h>
 #include <unistd.h>

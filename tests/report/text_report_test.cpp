@@ -19,8 +19,7 @@ TEST(TextReport, ProcessSectionsInTwoFormats) {
          {std::tuple<std::int64_t, std::int64_t, std::string>{VSSummaryFormatFormatted, 0, kDaemonFormatted},
           {VSSummaryFormatBytes, VSOutputOptionSwapped | VSOutputOptionWired, bytesWide}}) {
         ReportRun run;
-        addDaemon(run);
-        // A single process: no summary follows.
+        addDaemon(run);  // a single process: no summary follows
         EXPECT_EQ(run.report(format, options), expected);
     }
 }
