@@ -48,6 +48,7 @@ constexpr MeminfoSite kMeminfoSites[] = {
 };
 
 constexpr uint64_t kKernelStackTag = 8;
+constexpr uint64_t kNoAddress = ~uint64_t{0};
 
 // Where vmalloc'd thread stacks come from; depending on inlining the kernel
 // names one of these as the caller.
@@ -196,11 +197,21 @@ VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneNam
     // vmalloc areas by calling code address.
     if (vs::readFileAt(AT_FDCWD, "/proc/vmallocinfo", buffer, text) == 0) {
         const auto callers = vs::parseVmallocinfo(text);
-        const auto symbols = loadKallsyms();
+        // Only the few callers named here need an address: index those, not
+        // every kernel symbol. The first symbol of a name wins.
         std::unordered_map<std::string_view, uint64_t> addressOf;
-        addressOf.reserve(symbols->size());
+        for (const vs::VmallocCaller &caller : callers) {
+            std::string_view symbol;
+            uint64_t offset = 0;
+            vs::splitCaller(caller.caller, symbol, offset);
+            addressOf.try_emplace(symbol, kNoAddress);
+        }
+        const auto symbols = loadKallsyms();
         for (const vs::KernelSymbol &symbol : *symbols) {
-            addressOf.try_emplace(symbol.name, symbol.address);
+            auto it = addressOf.find(symbol.name);
+            if (it != addressOf.end() && it->second == kNoAddress) {
+                it->second = symbol.address;
+            }
         }
         uint64_t unresolved = 0;
         uint64_t stackBytes = 0;
@@ -215,7 +226,7 @@ VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneNam
                 stackBytes += info.size;
             }
             auto it = addressOf.find(symbol);
-            if (it != addressOf.end()) {
+            if (it != addressOf.end() && it->second != kNoAddress) {
                 info.site = it->second + offset;
             } else {
                 // Name it as the kernel printed it.
