@@ -23,8 +23,6 @@ std::function<Entries(std::string_view)> entries(Parsed (*parse)(std::string_vie
     };
 }
 const auto meminfo = entries(vs::parseMeminfo, [](const auto &e) { return e.name + " " + std::to_string(e.bytes); });
-const auto kallsyms =
-    entries(vs::parseKallsyms, [](const auto &s) { return std::to_string(s.address) + " " + s.name; });
 const auto slabinfo = entries(vs::parseSlabinfo, [](const auto &c) {
     return c.name + " " + std::to_string(c.activeObjects) + " " + std::to_string(c.objectSize) + " " +
            std::to_string(c.pagesPerSlab) + " " + std::to_string(c.slabs);
@@ -34,13 +32,6 @@ TEST(KernelParsers, MalformedLinesAreSkipped) {
     EXPECT_EQ(meminfo("MemTotal:       1000 kB\nno colon here 5 kB\n: 7 kB\nEmpty:\nLetters:   12a kB\n"
                       "Negative:  -3 kB\nHugePages_Total:       4\nOdd:   9 MB\n\nLast:  2 kB"),
               (Entries{"MemTotal 1024000", "HugePages_Total 4", "Odd 9", "Last 2048"}));
-    EXPECT_EQ(kallsyms("ffffffff81000000 T _stext\nffffffff81000100\nffffffff81000200 TT double_type\n"
-                       "zzzzzzzzzzzzzzzz T not_hex\n1ffffffff81000300 T seventeen_digits\n"
-                       "ffffffff81000400 D data_symbol\nffffffff81000500 t local_text [module]\n"
-                       "ffffffff81000050 W weak_text"),  // sorted on the way out
-              (Entries{std::to_string(0xffffffff81000000) + " _stext",
-                       std::to_string(0xffffffff81000050) + " weak_text",
-                       std::to_string(0xffffffff81000500) + " local_text"}));
     EXPECT_EQ(slabinfo("slabinfo - version: 2.1\nkmalloc-64 x 8 64 64 1 : tunables 0 0 0 : slabdata 3 4 0\n"
                        "kmalloc-32 8 8 32 128 1 ; tunables 0 0 0 : slabdata 3 4 0\n"
                        "kmalloc-8 8 8 8 512 1 : tunables 0 0 0 : slabdata 1 1 0"),

@@ -162,34 +162,6 @@ std::vector<VmallocCaller> parseVmallocinfo(std::string_view text) {
     return callers;
 }
 
-std::vector<KernelSymbol> parseKallsyms(std::string_view text) {
-    std::vector<KernelSymbol> symbols;
-    bool anyAddress = false;
-    forEachLine(text, [&](std::string_view line) {
-        std::string_view f[4];
-        const size_t n = fields(line, f, 4);
-        if (n < 3 || f[1].size() != 1) {
-            return;
-        }
-        const char type = f[1][0];
-        if (type != 't' && type != 'T' && type != 'W' && type != 'w') {
-            return;
-        }
-        uint64_t address = 0;
-        if (!hex(f[0], address)) {
-            return;
-        }
-        anyAddress = anyAddress || address != 0;
-        symbols.push_back(KernelSymbol{address, std::string(f[2])});
-    });
-    if (!anyAddress) {
-        return {};
-    }
-    std::stable_sort(symbols.begin(), symbols.end(),
-                     [](const KernelSymbol &a, const KernelSymbol &b) { return a.address < b.address; });
-    return symbols;
-}
-
 std::vector<KernelModule> parseModules(std::string_view text) {
     // name size refcount deps state address
     std::vector<KernelModule> modules;

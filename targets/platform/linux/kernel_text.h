@@ -2,7 +2,7 @@
 
 // Parsers for the kernel-wide memory files of /proc: slabinfo (the
 // kernel's zones), vmallocinfo (wired memory by the code that asked for
-// it), kallsyms (names of kernel code addresses) and modules. Pure
+// it) and modules. Pure
 // functions over text, tested on recorded captures.
 
 #include <cstdint>
@@ -37,15 +37,6 @@ std::vector<VmallocCaller> parseVmallocinfo(std::string_view text);
 // "symbol+0x94/0x3e0" -> symbol and offset. False when the text has no
 // offset part.
 bool splitCaller(std::string_view caller, std::string_view &symbol, uint64_t &offset);
-
-struct KernelSymbol {
-    uint64_t address = 0;
-    std::string name;
-};
-
-// Text symbols (types t and T) of kallsyms, sorted by address. Without
-// privilege every address reads 0: the result is then empty.
-std::vector<KernelSymbol> parseKallsyms(std::string_view text);
 
 struct KernelModule {
     std::string name;

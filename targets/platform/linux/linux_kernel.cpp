@@ -4,7 +4,7 @@
 // from three sources: /proc/meminfo for what the kernel keeps per purpose
 // (kernel stacks, page tables, per-cpu areas, locked user pages ...),
 // /proc/modules for loaded modules, and /proc/vmallocinfo summed per
-// calling code address, named through /proc/kallsyms. meminfo totals
+// calling code, named as the kernel prints it. meminfo totals
 // become the counter entries.
 
 #include "targets/platform/linux/kernel_text.h"
@@ -48,7 +48,6 @@ constexpr MeminfoSite kMeminfoSites[] = {
 };
 
 constexpr uint64_t kKernelStackTag = 8;
-constexpr uint64_t kNoAddress = ~uint64_t{0};
 
 // Where vmalloc'd thread stacks come from; depending on inlining the kernel
 // names one of these as the caller.
@@ -69,52 +68,13 @@ constexpr MeminfoCounter kMeminfoCounters[] = {
     {"Slab", 7},        // all zones together
 };
 
-// Sites whose caller could not be found in kallsyms get made-up site
-// numbers up here, far from any kernel address or small index.
-constexpr uint64_t kUnresolvedSiteBase = 1ull << 40;
+// vmalloc callers get made-up site numbers up here, far from any small
+// index; the listing's 40-bit object ids then show just the caller's number.
+constexpr uint64_t kCallerSiteBase = 1ull << 40;
 
 void setName(char (&field)[80], std::string_view text) {
     std::memset(field, 0, sizeof field);
     std::memcpy(field, text.data(), std::min(sizeof field - 1, text.size()));
-}
-
-class KallsymsSymbolicator : public VSKernelSymbolicator {
-public:
-    explicit KallsymsSymbolicator(std::shared_ptr<const std::vector<vs::KernelSymbol>> symbols)
-        : _symbols(std::move(symbols)) {}
-
-    std::optional<std::string> symbol_name_at(uint64_t address) const override {
-        auto it = std::upper_bound(
-            _symbols->begin(), _symbols->end(), address,
-            [](uint64_t a, const vs::KernelSymbol &s) { return a < s.address; });
-        if (it == _symbols->begin()) {
-            return std::nullopt;
-        }
-        return std::prev(it)->name;
-    }
-
-    std::optional<VSSourceLocation> source_location_at(uint64_t) const override {
-        return std::nullopt; // the running kernel carries no line tables
-    }
-
-private:
-    std::shared_ptr<const std::vector<vs::KernelSymbol>> _symbols;
-};
-
-std::shared_ptr<const std::vector<vs::KernelSymbol>> loadKallsyms() {
-    static std::mutex mutex;
-    static std::shared_ptr<const std::vector<vs::KernelSymbol>> cached;
-    std::lock_guard<std::mutex> lock(mutex);
-    if (!cached) {
-        vs::ReadBuffer buffer;
-        std::string_view text;
-        if (vs::readFileAt(AT_FDCWD, "/proc/kallsyms", buffer, text) == 0) {
-            cached = std::make_shared<const std::vector<vs::KernelSymbol>>(vs::parseKallsyms(text));
-        } else {
-            cached = std::make_shared<const std::vector<vs::KernelSymbol>>();
-        }
-    }
-    return cached;
 }
 
 bool slabReclaimable(const std::string &name) {
@@ -194,30 +154,18 @@ VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneNam
         }
     }
 
-    // vmalloc areas by calling code address.
+    // vmalloc areas by calling code address. The kernel prints each caller
+    // already named ("kernel_clone+0x94/0x3e0"); finding its address would
+    // mean reading all of kallsyms, which costs the kernel more than every
+    // other kernel file together. So each caller is a site of its own under
+    // a made-up number, carrying the function's name.
     if (vs::readFileAt(AT_FDCWD, "/proc/vmallocinfo", buffer, text) == 0) {
-        const auto callers = vs::parseVmallocinfo(text);
-        // Only the few callers named here need an address: index those, not
-        // every kernel symbol. The first symbol of a name wins.
-        std::unordered_map<std::string_view, uint64_t> addressOf;
-        for (const vs::VmallocCaller &caller : callers) {
-            std::string_view symbol;
-            uint64_t offset = 0;
-            vs::splitCaller(caller.caller, symbol, offset);
-            addressOf.try_emplace(symbol, kNoAddress);
-        }
-        const auto symbols = loadKallsyms();
-        for (const vs::KernelSymbol &symbol : *symbols) {
-            auto it = addressOf.find(symbol.name);
-            if (it != addressOf.end() && it->second == kNoAddress) {
-                it->second = symbol.address;
-            }
-        }
-        uint64_t unresolved = 0;
+        uint64_t callerNumber = 0;
         uint64_t stackBytes = 0;
-        for (const vs::VmallocCaller &caller : callers) {
+        for (const vs::VmallocCaller &caller : vs::parseVmallocinfo(text)) {
             VSKernelSiteInfo info;
-            info.flags = vs::kSiteTypeCodeAddress | vs::kSiteFlagWired;
+            info.flags = vs::kSiteTypeCodeAddress | vs::kSiteFlagWired | vs::kSiteFlagNamed;
+            info.site = kCallerSiteBase + ++callerNumber;
             info.size = caller.pages * _pageSize;
             std::string_view symbol;
             uint64_t offset = 0;
@@ -225,15 +173,7 @@ VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneNam
             if (isThreadStackAllocator(symbol)) {
                 stackBytes += info.size;
             }
-            auto it = addressOf.find(symbol);
-            if (it != addressOf.end() && it->second != kNoAddress) {
-                info.site = it->second + offset;
-            } else {
-                // Name it as the kernel printed it.
-                info.site = kUnresolvedSiteBase + ++unresolved;
-                info.flags |= vs::kSiteFlagNamed;
-                setName(info.name, symbol);
-            }
+            setName(info.name, symbol);
             arrays->siteInfos.push_back(info);
         }
         // With virtually mapped stacks the same pages are also counted in
@@ -298,11 +238,8 @@ std::map<std::string, VSKextInfo> VSLinuxPlatform::loaded_kext_info() {
 }
 
 std::unique_ptr<VSKernelSymbolicator> VSLinuxPlatform::kernel_symbolicator() {
-    auto symbols = loadKallsyms();
-    if (symbols->empty()) {
-        return nullptr;
-    }
-    return std::make_unique<KallsymsSymbolicator>(std::move(symbols));
+    // Every code-address site carries its caller's name already.
+    return nullptr;
 }
 
 VSReturnCode VSLinuxPlatform::ports_lookup(std::vector<uint32_t> &ports) {
