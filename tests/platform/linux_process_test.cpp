@@ -327,6 +327,46 @@ TEST_F(LinuxProcessTest, ProcessThatGoesAwayWhileRead) {
     EXPECT_EQ(platform.error_text(ESRCH), "No such process");
 }
 
+TEST_F(LinuxProcessTest, ProcessThatExecsAfterItsHandleIsOpened) {
+    // The handle is opened while the child still runs this program; the
+    // walk must see the address space of the program it then becomes.
+    int go[2], out[2];
+    ASSERT_EQ(pipe2(go, O_CLOEXEC), 0);
+    ASSERT_EQ(pipe2(out, O_CLOEXEC), 0);
+    const pid_t pid = fork();
+    if (pid == 0) {
+        char byte;
+        if (read(go[0], &byte, 1) != 1) {
+            _exit(3);
+        }
+        dup2(go[0], 0); // it lives until the test closes its end
+        dup2(out[1], 1);
+        execl(kMemChild.c_str(), kMemChild.c_str(), "anon:a:6:6", nullptr);
+        _exit(127);
+    }
+    close(go[0]);
+    close(out[1]);
+    const VSTaskHandle task = taskFor(pid);
+    ASSERT_EQ(write(go[1], "x", 1), 1);
+    std::string lines;
+    char buffer[512];
+    for (ssize_t n; lines.find("ready") == std::string::npos && (n = read(out[0], buffer, sizeof buffer)) > 0;) {
+        lines.append(buffer, static_cast<size_t>(n));
+    }
+    const size_t at = lines.find("a start=");
+    ASSERT_NE(at, std::string::npos) << lines;
+    const uint64_t start = std::strtoull(lines.c_str() + at + 8, nullptr, 16);
+    std::vector<WalkedRegion> regions;
+    EXPECT_EQ(walk(platform, task, regions), vs::kReturnNoMoreRegions);
+    const WalkedRegion *arranged = containing(regions, start);
+    ASSERT_NE(arranged, nullptr);
+    EXPECT_EQ(arranged->info.residentPages, 6u);
+    close(go[1]); // end of input: the child exits
+    close(out[0]);
+    waitpid(pid, nullptr, 0);
+    platform.release_task_handle(task);
+}
+
 TEST_F(LinuxProcessTest, AnotherUsersProcessIsRefused) {
     MemChild child({"anon:a:1:1"});
     ASSERT_TRUE(child.ready());

@@ -25,6 +25,11 @@ using vs::ReadBuffer;
 using vs::SmapsRegion;
 using vs::UniqueFd;
 
+struct VSLinuxPlatform::Listed {
+    UniqueFd dir;
+    std::optional<vs::ProcStat> stat;
+};
+
 struct VSLinuxPlatform::Task {
     // The memory lines of /proc/PID/status that the process-wide counters use.
     struct StatusFigures {
@@ -43,6 +48,9 @@ struct VSLinuxPlatform::Task {
     UniqueFd dir;
 
     std::mutex mutex; // guards everything below
+    // smaps, opened with the handle (the open is where the kernel checks
+    // the right to read the process) and read by the first parse.
+    UniqueFd smaps;
     bool parsed = false;
     VSReturnCode parseCode = 0;
     std::vector<SmapsRegion> regions;
@@ -179,10 +187,10 @@ int openProc(int32_t pid, int flags) {
 }
 
 // Reads /proc/PID/<name> into the thread's buffer. 0 or the errno.
-int readPidFile(int32_t pid, const char *name, std::string_view &text) {
+int readPidFile(int32_t pid, const char *name, std::string_view &text, bool onePiece = false) {
     char path[96];
     std::snprintf(path, sizeof path, "%s/%d/%s", VSLinuxPlatform::kProcRoot, pid, name);
-    return vs::readFileAt(AT_FDCWD, path, text);
+    return onePiece ? vs::readOnePieceFileAt(AT_FDCWD, path, text) : vs::readFileAt(AT_FDCWD, path, text);
 }
 
 } // namespace
@@ -221,6 +229,7 @@ int32_t VSLinuxPlatform::list_all_pids(std::span<int32_t> buffer) {
     std::vector<int32_t> pids;
     pids.push_back(0); // the kernel stands for all kernel threads
     const bool counting = buffer.empty();
+    std::unordered_map<int32_t, std::shared_ptr<Listed>> listed;
     while (const dirent *entry = ::readdir(dir)) {
         const char *name = entry->d_name;
         if (name[0] < '1' || name[0] > '9') {
@@ -232,14 +241,20 @@ int32_t VSLinuxPlatform::list_all_pids(std::span<int32_t> buffer) {
             continue;
         }
         if (!counting) {
+            // Kernel threads are left out, which takes their stat; the
+            // record of every other process is asked for next, so keep
+            // what was read for it.
+            auto process = std::make_shared<Listed>();
+            process->dir = UniqueFd(::openat(::dirfd(dir), name, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
             std::string_view text;
-            if (readPidFile(static_cast<int32_t>(pid), "stat", text) != 0) {
+            if (!process->dir.valid() || vs::readOnePieceFileAt(process->dir.get(), "stat", text) != 0) {
                 continue; // exited meanwhile
             }
-            const auto st = vs::parseStat(text);
-            if (!st || (st->flags & vs::kLinuxKernelThreadFlag) != 0) {
+            process->stat = vs::parseStat(text);
+            if (!process->stat || (process->stat->flags & vs::kLinuxKernelThreadFlag) != 0) {
                 continue;
             }
+            listed.emplace(static_cast<int32_t>(pid), std::move(process));
         }
         pids.push_back(static_cast<int32_t>(pid));
     }
@@ -247,10 +262,20 @@ int32_t VSLinuxPlatform::list_all_pids(std::span<int32_t> buffer) {
     if (counting) {
         return static_cast<int32_t>(pids.size());
     }
+    {
+        std::lock_guard<std::mutex> lock(_listedMutex);
+        _listed.swap(listed); // what an earlier listing kept is dropped
+    }
     std::sort(pids.begin(), pids.end());
     const size_t stored = std::min(pids.size(), buffer.size());
     std::copy_n(pids.begin(), stored, buffer.begin());
     return static_cast<int32_t>(stored);
+}
+
+std::shared_ptr<VSLinuxPlatform::Listed> VSLinuxPlatform::_listedFor(int32_t pid) {
+    std::lock_guard<std::mutex> lock(_listedMutex);
+    auto it = _listed.find(pid);
+    return it == _listed.end() ? nullptr : it->second;
 }
 
 int32_t VSLinuxPlatform::pid_bsd_info(int32_t pid, VSBsdInfo &info) {
@@ -264,18 +289,32 @@ int32_t VSLinuxPlatform::pid_bsd_info(int32_t pid, VSBsdInfo &info) {
     if (pid < 0) {
         return 0;
     }
-    const int dirFd = openProc(pid, O_RDONLY | O_DIRECTORY);
+    // The stat the listing read moments ago serves once; asked again, the
+    // record is read anew.
+    std::optional<vs::ProcStat> st;
+    UniqueFd ownDir;
+    int dirFd = -1;
+    if (std::shared_ptr<Listed> listed = _listedFor(pid)) {
+        std::lock_guard<std::mutex> lock(_listedMutex);
+        st.swap(listed->stat);
+        dirFd = listed->dir.get();
+    }
     if (dirFd < 0) {
-        return 0;
+        ownDir = UniqueFd(openProc(pid, O_RDONLY | O_DIRECTORY));
+        dirFd = ownDir.get();
+        if (dirFd < 0) {
+            return 0;
+        }
     }
-    UniqueFd dir(dirFd);
-    std::string_view text;
-    if (vs::readFileAt(dir.get(), "stat", text) != 0) {
-        return 0;
-    }
-    const auto st = vs::parseStat(text);
     if (!st) {
-        return 0;
+        std::string_view text;
+        if (vs::readOnePieceFileAt(dirFd, "stat", text) != 0) {
+            return 0;
+        }
+        st = vs::parseStat(text);
+        if (!st) {
+            return 0;
+        }
     }
     info.pid = static_cast<uint32_t>(pid);
     info.ppid = static_cast<uint32_t>(st->ppid);
@@ -284,7 +323,7 @@ int32_t VSLinuxPlatform::pid_bsd_info(int32_t pid, VSBsdInfo &info) {
 
     bool is64 = hostIs64Bit();
     unsigned char ident[EI_NIDENT] = {};
-    if (vs::readBytesAt(dir.get(), "exe", 0, ident, EI_CLASS + 1) == EI_CLASS + 1 &&
+    if (vs::readBytesAt(dirFd, "exe", 0, ident, EI_CLASS + 1) == EI_CLASS + 1 &&
         std::memcmp(ident, ELFMAG, SELFMAG) == 0) {
         is64 = ident[EI_CLASS] == ELFCLASS64;
     }
@@ -298,7 +337,7 @@ int32_t VSLinuxPlatform::pid_short_info(int32_t pid, VSShortInfo &info, int32_t 
     info = VSShortInfo{};
     errorNumber = 0;
     std::string_view text;
-    const int error = pid > 0 ? readPidFile(pid, "stat", text) : ESRCH;
+    const int error = pid > 0 ? readPidFile(pid, "stat", text, true) : ESRCH;
     if (error != 0) {
         errorNumber = (error == ENOENT || error == ESRCH) ? vs::kErrorNoSuchProcess : error;
         return 0;
@@ -348,7 +387,7 @@ int32_t VSLinuxPlatform::pid_resource_usage(int32_t pid, int32_t version,
     }
     if (!kept) {
         std::string_view status;
-        const int error = readPidFile(pid, "status", status);
+        const int error = readPidFile(pid, "status", status, true);
         if (error != 0) {
             return error == ENOENT ? ESRCH : error;
         }
@@ -479,7 +518,7 @@ int32_t VSLinuxPlatform::process_argument_area(int32_t pid, std::span<char> buff
         exePath.remove_suffix(kDeleted.size()); // the name is what matters
     }
     std::string_view cmdline;
-    if (vs::readFileAt(dirFd, "cmdline", cmdline) != 0) {
+    if (vs::readOnePieceFileAt(dirFd, "cmdline", cmdline) != 0) {
         cmdline = {};
     }
 
@@ -539,19 +578,28 @@ VSReturnCode VSLinuxPlatform::task_handle_for_pid(int32_t pid, VSTaskHandle &tas
     if (pid <= 0) {
         return ESRCH;
     }
-    const int dirFd = openProc(pid, O_RDONLY | O_DIRECTORY);
-    if (dirFd < 0) {
-        return errno == ENOENT ? ESRCH : errno;
-    }
     auto entry = std::make_shared<Task>();
     entry->pid = pid;
-    entry->dir = UniqueFd(dirFd);
-    // Whether the process may be read at all shows when its maps open.
-    const int mapsFd = ::openat(dirFd, "maps", O_RDONLY | O_CLOEXEC);
-    if (mapsFd < 0) {
+    {
+        // The directory the listing opened names the process it listed.
+        std::lock_guard<std::mutex> lock(_listedMutex);
+        auto it = _listed.find(pid);
+        if (it != _listed.end()) {
+            entry->dir = std::move(it->second->dir);
+            _listed.erase(it);
+        }
+    }
+    if (!entry->dir.valid()) {
+        entry->dir = UniqueFd(openProc(pid, O_RDONLY | O_DIRECTORY));
+        if (!entry->dir.valid()) {
+            return errno == ENOENT ? ESRCH : errno;
+        }
+    }
+    // Whether the process may be read at all shows when its smaps opens.
+    entry->smaps = UniqueFd(::openat(entry->dir.get(), "smaps", O_RDONLY | O_CLOEXEC));
+    if (!entry->smaps.valid()) {
         return errno;
     }
-    ::close(mapsFd);
     task = _registerTask(std::move(entry));
     return 0;
 }
@@ -586,7 +634,20 @@ const std::vector<uint64_t> &VSLinuxPlatform::_tmpfsDevices() {
 VSReturnCode VSLinuxPlatform::_parse(Task &task) {
     ReadBuffer &buffer = vs::threadReadBuffer();
     std::string_view text;
-    const int error = vs::readFileAt(task.dir.get(), "smaps", buffer, text);
+    int error = 0;
+    if (task.smaps.valid()) {
+        error = vs::readAll(task.smaps.get(), buffer, text, vs::kRecordFileChunk);
+        // Opened before an exec, the file shows the address space the
+        // process has left: empty. Its new one needs a new open.
+        if (error == 0 && text.empty()) {
+            task.smaps = UniqueFd();
+        }
+    }
+    if (!task.smaps.valid()) {
+        task.smaps = UniqueFd(::openat(task.dir.get(), "smaps", O_RDONLY | O_CLOEXEC));
+        error = task.smaps.valid() ? vs::readAll(task.smaps.get(), buffer, text, vs::kRecordFileChunk) : errno;
+    }
+    task.smaps = UniqueFd(); // a parse asked for again reads anew
     if (error != 0) {
         return (error == ESRCH || error == ENOENT) ? vs::kReturnDeadPort : regionErrno(error);
     }
@@ -837,7 +898,7 @@ VSReturnCode VSLinuxPlatform::task_memory_info(VSTaskHandle handle, VSTaskKernel
         return EINVAL;
     }
     std::string_view status;
-    const int error = vs::readFileAt(task->dir.get(), "status", status);
+    const int error = vs::readOnePieceFileAt(task->dir.get(), "status", status);
     if (error != 0) {
         return (error == ESRCH || error == ENOENT) ? vs::kReturnDeadPort : error;
     }

@@ -115,6 +115,14 @@ private:
     std::unordered_multimap<int32_t, VSTaskHandle> _handlesByPid;
     VSTaskHandle _lastHandle = 0;
 
+    // What the last listing opened and read of each process, for the
+    // record and the task handle that follow it at once: the directory fd
+    // (taken by the handle) and the parsed stat (taken by the record).
+    struct Listed;
+    std::mutex _listedMutex;
+    std::unordered_map<int32_t, std::shared_ptr<Listed>> _listed;
+    std::shared_ptr<Listed> _listedFor(int32_t pid);
+
     std::once_flag _tmpfsOnce;
     std::vector<uint64_t> _tmpfs;
 

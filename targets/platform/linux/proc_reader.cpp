@@ -1,5 +1,6 @@
 #include "targets/platform/linux/proc_reader.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
@@ -58,7 +59,7 @@ ReadBuffer &threadReadBuffer() {
     return buffer;
 }
 
-int readAll(int fd, ReadBuffer &buffer, std::string_view &text) {
+int readAll(int fd, ReadBuffer &buffer, std::string_view &text, size_t chunk) {
     if (buffer.capacity() == 0) {
         buffer.reserve(kInitialBuffer);
     }
@@ -67,7 +68,7 @@ int readAll(int fd, ReadBuffer &buffer, std::string_view &text) {
         if (used == buffer.capacity()) {
             buffer.reserve(buffer.capacity() * 2); // keeps what was read
         }
-        const ssize_t n = ::pread(fd, buffer.data() + used, buffer.capacity() - used,
+        const ssize_t n = ::pread(fd, buffer.data() + used, std::min(chunk, buffer.capacity() - used),
                                   static_cast<off_t>(used));
         if (n < 0) {
             if (errno == EINTR) {
@@ -98,30 +99,41 @@ int readFileAt(int dirFd, const char *name, std::string_view &text) {
     return readFileAt(dirFd, name, threadReadBuffer(), text);
 }
 
+int readOnePieceFileAt(int dirFd, const char *name, std::string_view &text) {
+    const int fd = ::openat(dirFd, name, O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
+        return errno;
+    }
+    ReadBuffer &buffer = threadReadBuffer();
+    if (buffer.capacity() == 0) {
+        buffer.reserve(kInitialBuffer);
+    }
+    ssize_t n;
+    do {
+        n = ::pread(fd, buffer.data(), buffer.capacity(), 0);
+    } while (n < 0 && errno == EINTR);
+    int error = n < 0 ? errno : 0;
+    if (n >= 0 && static_cast<size_t>(n) < buffer.capacity()) {
+        text = std::string_view(buffer.data(), static_cast<size_t>(n));
+    } else if (n >= 0) {
+        error = readAll(fd, buffer, text); // larger than the buffer after all
+    }
+    ::close(fd);
+    return error;
+}
+
 int64_t readBytesAt(int dirFd, const char *name, uint64_t offset, void *out, size_t size) {
     const int fd = ::openat(dirFd, name, O_RDONLY | O_CLOEXEC);
     if (fd < 0) {
         return -errno;
     }
-    size_t done = 0;
-    while (done < size) {
-        const ssize_t n = ::pread(fd, static_cast<char *>(out) + done, size - done,
-                                  static_cast<off_t>(offset + done));
-        if (n < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            const int error = errno;
-            ::close(fd);
-            return done > 0 ? static_cast<int64_t>(done) : -error;
-        }
-        if (n == 0) {
-            break;
-        }
-        done += static_cast<size_t>(n);
-    }
+    ssize_t n;
+    do {
+        n = ::pread(fd, out, size, static_cast<off_t>(offset));
+    } while (n < 0 && errno == EINTR);
+    const int64_t result = n < 0 ? -errno : n;
     ::close(fd);
-    return static_cast<int64_t>(done);
+    return result;
 }
 
 UniqueFd &UniqueFd::operator=(UniqueFd &&other) noexcept {
