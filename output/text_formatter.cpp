@@ -2,6 +2,8 @@
 
 #include <bsd/libutil.h>
 
+#include <algorithm>
+#include <charconv>
 #include <cstring>
 
 #include "analysis/vestage.h"
@@ -14,6 +16,15 @@ namespace {
 
 constexpr const char *kRulePiece = "==========";
 constexpr const char *kSeparator = "---";
+
+// Appends `text` right-aligned in `width` columns (wider text as it is).
+void padLeft(std::string &line, int width, const char *text) {
+    const std::size_t length = std::strlen(text);
+    if (length < static_cast<std::size_t>(std::max(width, 0))) {
+        line.append(static_cast<std::size_t>(width) - length, ' ');
+    }
+    line.append(text, length);
+}
 
 std::uint64_t pagesOf(std::uint64_t bytes, std::uint64_t pageSize) {
     return pageSize == 0 ? 0 : (bytes + pageSize - 1) / pageSize;
@@ -80,26 +91,37 @@ void VSOutputFormatterText::_printRule(bool closing) {
     }
 }
 
-void VSOutputFormatterText::_printTableHeader() {
+void VSOutputFormatterText::_putRow(const char *dirty, const char *swapped, const char *clean,
+                                    const char *reclaimable, const char *wired, const char *regions,
+                                    const char *label) {
     const ColumnWidths w = _columnWidths();
-    std::fprintf(_output, "%*s%*s%*s%*s%*s %10s    %s\n", w.dirty, "Dirty", w.swapped,
-                 _showsSwapped() ? "(Swapped)" : "", w.clean, "Clean", w.reclaimable, "Reclaimable", w.wired,
-                 _showsWired() ? "(Wired)" : "", "Regions", "Category");
+    _line.clear();
+    padLeft(_line, w.dirty, dirty);
+    padLeft(_line, w.swapped, swapped);
+    padLeft(_line, w.clean, clean);
+    padLeft(_line, w.reclaimable, reclaimable);
+    padLeft(_line, w.wired, wired);
+    _line.push_back(' ');
+    padLeft(_line, 10, regions);
+    _line.append("    ");
+    _line.append(label);
+    _line.push_back('\n');
+    std::fwrite(_line.data(), 1, _line.size(), _output);
+}
+
+void VSOutputFormatterText::_printTableHeader() {
+    _putRow("Dirty", _showsSwapped() ? "(Swapped)" : "", "Clean", "Reclaimable", _showsWired() ? "(Wired)" : "",
+            "Regions", "Category");
 }
 
 void VSOutputFormatterText::_printSeparatorRow() {
-    const ColumnWidths w = _columnWidths();
-    std::fprintf(_output, "%*s%*s%*s%*s%*s %10s    %s\n", w.dirty, kSeparator, w.swapped,
-                 _showsSwapped() ? kSeparator : "", w.clean, kSeparator, w.reclaimable, kSeparator, w.wired,
-                 _showsWired() ? kSeparator : "", kSeparator, kSeparator);
+    _putRow(kSeparator, _showsSwapped() ? kSeparator : "", kSeparator, kSeparator, _showsWired() ? kSeparator : "",
+            kSeparator, kSeparator);
 }
 
 void VSOutputFormatterText::_printRow(std::uint64_t dirtyAndSwapped, std::uint64_t swapped, std::uint64_t clean,
                                       std::uint64_t reclaimable, std::uint64_t wired, std::int64_t regions,
                                       const char *label) {
-    // A report has a row per category per table: the figures are formatted
-    // into buffers on the stack rather than strings.
-    const ColumnWidths w = _columnWidths();
     char dirtyText[32], swappedText[32] = "", cleanText[32], reclaimableText[32], wiredText[32] = "";
     if (_showsSwapped()) {
         _formatSize(swapped, swappedText);
@@ -107,9 +129,10 @@ void VSOutputFormatterText::_printRow(std::uint64_t dirtyAndSwapped, std::uint64
     if (_showsWired()) {
         _formatSize(wired, wiredText);
     }
-    std::fprintf(_output, "%*s%*s%*s%*s%*s %10d    %s\n", w.dirty, _formatSize(dirtyAndSwapped, dirtyText), w.swapped,
-                 swappedText, w.clean, _formatSize(clean, cleanText), w.reclaimable,
-                 _formatSize(reclaimable, reclaimableText), w.wired, wiredText, static_cast<int>(regions), label);
+    char regionsText[16];
+    *std::to_chars(regionsText, regionsText + sizeof regionsText - 1, static_cast<int>(regions)).ptr = '\0';
+    _putRow(_formatSize(dirtyAndSwapped, dirtyText), swappedText, _formatSize(clean, cleanText),
+            _formatSize(reclaimable, reclaimableText), wiredText, regionsText, label);
 }
 
 void VSOutputFormatterText::_printCategories(const VSCategoryTable &categories,
