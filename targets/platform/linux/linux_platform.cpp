@@ -19,6 +19,7 @@
 #include <malloc.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <unistd.h>
 
 using vs::ReadBuffer;
@@ -321,11 +322,19 @@ int32_t VSLinuxPlatform::pid_bsd_info(int32_t pid, VSBsdInfo &info) {
     copyName(info.commandName, sizeof info.commandName, st->comm);
     copyName(info.name, sizeof info.name, st->comm);
 
+    // The width is the executable's ELF class. Most processes run one of a
+    // few programs: their headers are read once per file, through the first
+    // process met that runs it.
     bool is64 = hostIs64Bit();
-    unsigned char ident[EI_NIDENT] = {};
-    if (vs::readBytesAt(dirFd, "exe", 0, ident, EI_CLASS + 1) == EI_CLASS + 1 &&
-        std::memcmp(ident, ELFMAG, SELFMAG) == 0) {
-        is64 = ident[EI_CLASS] == ELFCLASS64;
+    struct stat exe {};
+    if (::fstatat(dirFd, "exe", &exe, 0) == 0 && S_ISREG(exe.st_mode)) {
+        const uint64_t device = (uint64_t{major(exe.st_dev)} << 32) | minor(exe.st_dev);
+        auto readExe = [](void *context, uint64_t offset, void *out, size_t size) {
+            return vs::readBytesAt(*static_cast<int *>(context), "exe", offset, out, size);
+        };
+        if (auto program = vs::ElfCache::shared().lookup(device, exe.st_ino, readExe, &dirFd)) {
+            is64 = program->is64bit;
+        }
     }
     if (is64) {
         info.flags |= vs::kBsdInfoFlag64Bit;
@@ -1008,12 +1017,25 @@ std::optional<std::string> VSLinuxPlatform::dynamic_tag_name(uint32_t tag) {
 // ---- this program's own task ---------------------------------------------------------------
 
 int32_t VSLinuxPlatform::sysctl_by_name_read(std::string_view name, int32_t &value) {
+    // Every target asks for the same setting, which this kernel may not
+    // have: one failed lookup answers for the run.
+    std::string key(name);
+    {
+        std::lock_guard<std::mutex> lock(_missingSettingsMutex);
+        if (_missingSettings.count(key) != 0) {
+            return ENOENT;
+        }
+    }
     std::string path = "/proc/sys/";
     for (char c : name) {
         path.push_back(c == '.' ? '/' : c);
     }
     std::string_view text;
     const int error = vs::readFileAt(AT_FDCWD, path.c_str(), text);
+    if (error == ENOENT) {
+        std::lock_guard<std::mutex> lock(_missingSettingsMutex);
+        _missingSettings.insert(std::move(key));
+    }
     if (error != 0) {
         return error;
     }

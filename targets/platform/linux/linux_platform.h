@@ -25,6 +25,7 @@
 #include <optional>
 #include <string>
 #include <unordered_map>
+#include <unordered_set>
 #include <vector>
 
 namespace vs {
@@ -122,6 +123,9 @@ private:
     std::mutex _listedMutex;
     std::unordered_map<int32_t, std::shared_ptr<Listed>> _listed;
     std::shared_ptr<Listed> _listedFor(int32_t pid);
+
+    std::mutex _missingSettingsMutex;
+    std::unordered_set<std::string> _missingSettings;
 
     std::once_flag _tmpfsOnce;
     std::vector<uint64_t> _tmpfs;
