@@ -208,9 +208,16 @@ VSLinuxPlatform::VSLinuxPlatform() : _pageSize(static_cast<uint64_t>(::sysconf(_
     // Every task handle holds a directory fd for the whole run, and a run
     // over all processes opens one per process: lift the soft fd limit.
     rlimit files{};
-    if (::getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
-        files.rlim_cur = files.rlim_max;
-        ::setrlimit(RLIMIT_NOFILE, &files);
+    if (::getrlimit(RLIMIT_NOFILE, &files) == 0) {
+        if (files.rlim_cur < files.rlim_max) {
+            files.rlim_cur = files.rlim_max;
+            ::setrlimit(RLIMIT_NOFILE, &files);
+            ::getrlimit(RLIMIT_NOFILE, &files);
+        }
+        // Files kept open only to save opening them again are kept while
+        // half of the fds are free: the handles' directories, which a run
+        // needs, come first.
+        _keptFdLimit = static_cast<int>(std::min<rlim_t>(files.rlim_cur / 2, INT_MAX));
     }
 }
 
@@ -243,8 +250,9 @@ int32_t VSLinuxPlatform::list_all_pids(std::span<int32_t> buffer) {
         }
         if (!counting) {
             // Kernel threads are left out, which takes their stat; the
-            // record of every other process is asked for next, so keep
-            // what was read for it.
+            // record and the handle of every other process are asked for
+            // next, so keep what was read and, while fds are plentiful, the
+            // directory it was read through.
             auto process = std::make_shared<Listed>();
             process->dir = UniqueFd(::openat(::dirfd(dir), name, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
             std::string_view text;
@@ -252,6 +260,9 @@ int32_t VSLinuxPlatform::list_all_pids(std::span<int32_t> buffer) {
                 continue; // exited meanwhile
             }
             process->stat = vs::parseStat(text);
+            if (process->dir.get() >= _keptFdLimit) {
+                process->dir = UniqueFd();
+            }
             if (!process->stat || (process->stat->flags & vs::kLinuxKernelThreadFlag) != 0) {
                 continue;
             }
@@ -608,6 +619,9 @@ VSReturnCode VSLinuxPlatform::task_handle_for_pid(int32_t pid, VSTaskHandle &tas
     entry->smaps = UniqueFd(::openat(entry->dir.get(), "smaps", O_RDONLY | O_CLOEXEC));
     if (!entry->smaps.valid()) {
         return errno;
+    }
+    if (entry->smaps.get() >= _keptFdLimit) {
+        entry->smaps = UniqueFd(); // opened again by the parse
     }
     task = _registerTask(std::move(entry));
     return 0;

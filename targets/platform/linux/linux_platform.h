@@ -124,6 +124,9 @@ private:
     std::unordered_map<int32_t, std::shared_ptr<Listed>> _listed;
     std::shared_ptr<Listed> _listedFor(int32_t pid);
 
+    // Files kept open to save opening them again only get fds below this.
+    int _keptFdLimit = 512;
+
     std::mutex _missingSettingsMutex;
     std::unordered_set<std::string> _missingSettings;
 
