@@ -37,14 +37,15 @@ struct ProcessGroupLess {
 
 class VSVestageSharingData {
 public:
-    // A target's groups, in group order. Each group is stored once, as a key
-    // of processGroupToObjects, and pointed to from here: a group of a few
-    // hundred targets is not copied for every one of its members.
-    using ProcessGroups = std::set<const VSProcessGroup *, vs::ProcessGroupLess>;
-    // Keyed by the target's asNumber (its pid).
-    using ProcessToProcessGroups = std::map<std::int64_t, ProcessGroups>;
     // The objects whose group is exactly the key, in the order first met.
     using ProcessGroupToObjects = std::map<VSProcessGroup, vs::MemoryObjectSet, vs::ProcessGroupLess>;
+    // A target's groups with their objects, in group order. Each group is
+    // stored once, as an entry of processGroupToObjects, and pointed to from
+    // here: a group of a few hundred targets is neither copied nor compared
+    // for every one of its members.
+    using ProcessGroups = std::vector<const ProcessGroupToObjects::value_type *>;
+    // Keyed by the target's asNumber (its pid).
+    using ProcessToProcessGroups = std::map<std::int64_t, ProcessGroups>;
 
     const ProcessToProcessGroups &processToProcessGroups() const { return _processToProcessGroups; }
     void setProcessToProcessGroups(ProcessToProcessGroups value) { _processToProcessGroups = std::move(value); }

@@ -221,19 +221,20 @@ VSCategoryTable VSVestage::_categoriesForAllProcesses() const {
             if (!first) {
                 continue;
             }
-            finder.categoryFor(region->sharedName(), region->segment()).addMemoryObject(object);
+            finder.categoryFor(region->sharedName(), region->segment()).addNewMemoryObject(object);
         }
     }
     return table;
 }
 
+// The objects are a group's set: distinct, so each is added without a lookup.
 VSCategoryTable VSVestage::_categoriesForObjects(std::span<VSMemoryObject *const> objects) const {
     VSCategoryTable table;
     CategoryFinder finder(table);
     for (VSMemoryObject *object : objects) {
         const vs::RegionSet &regions = object->memoryRegions();
         const VSSegmentKind segment = regions.empty() ? VSSegmentUnknown : (*regions.begin())->segment();
-        finder.categoryFor(object->sharedName(), segment).addMemoryObject(object);
+        finder.categoryFor(object->sharedName(), segment).addNewMemoryObject(object);
     }
     return table;
 }
@@ -247,7 +248,7 @@ VSCategoryTable VSVestage::_summarizedCategoriesForCategories(VSCategoryTable ca
         addToTotals(outTotal, category);
         if (summarize && isFoldable(category)) {
             for (VSMemoryObject *object : category.memoryObjects()) {
-                other.addMemoryObject(object);
+                other.addNewMemoryObject(object); // categories of one table share no object
             }
         } else {
             result.insert_or_assign(name, std::move(category));
@@ -407,15 +408,8 @@ std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
 
     // Phase two: objects by group, groups by target.
     VSVestageSharingData::ProcessGroupToObjects processGroupToObjects;
-    VSVestageSharingData::ProcessToProcessGroups processToProcessGroups;
     auto objectsOfGroup = [&](const VSProcessGroup &group) -> vs::MemoryObjectSet & {
-        auto [entry, newGroup] = processGroupToObjects.try_emplace(group);
-        if (newGroup) {
-            for (const VSProcess *member : group) {
-                processToProcessGroups[member->asNumber()].insert(&entry->first);
-            }
-        }
-        return entry->second;
+        return processGroupToObjects.try_emplace(group).first->second;
     };
     // A target's private group is looked up once, not once per object.
     std::unordered_map<const VSProcess *, vs::MemoryObjectSet *> privateObjects;
@@ -427,13 +421,20 @@ std::unique_ptr<VSVestageSharingData> VSVestage::_sharingData() const {
             if (set == nullptr) {
                 set = &objectsOfGroup(VSProcessGroup{members.first});
             }
-            set->insert(object);
+            set->appendNew(object); // each object is visited once
             continue;
         }
         VSProcessGroup &group = lists[members.more - 1];
         std::stable_sort(group.begin(), group.end(),
                          [](const VSProcess *a, const VSProcess *b) { return a->pid() < b->pid(); });
-        objectsOfGroup(group).insert(object);
+        objectsOfGroup(group).appendNew(object);
+    }
+    // Visiting the groups in their order lists each target's in that order.
+    VSVestageSharingData::ProcessToProcessGroups processToProcessGroups;
+    for (const auto &entry : processGroupToObjects) {
+        for (const VSProcess *member : entry.first) {
+            processToProcessGroups[member->asNumber()].push_back(&entry);
+        }
     }
 
     auto sharing = std::make_unique<VSVestageSharingData>();
@@ -543,19 +544,20 @@ void VSVestage::printOutputVerbose(bool verbose, bool summarize) {
 
         // The memory the process alone maps first, then each group it
         // shares with, in group order.
-        std::vector<const VSProcessGroup *> groups;
+        VSVestageSharingData::ProcessGroups groups;
         auto found = sharing->processToProcessGroups().find(process->asNumber());
         if (found != sharing->processToProcessGroups().end()) {
-            for (const VSProcessGroup *group : found->second) {
-                if (group->size() == 1) {
-                    groups.insert(groups.begin(), group);
+            for (const auto *entry : found->second) {
+                if (entry->first.size() == 1) {
+                    groups.insert(groups.begin(), entry);
                 } else {
-                    groups.push_back(group);
+                    groups.push_back(entry);
                 }
             }
         }
-        for (const VSProcessGroup *group : groups) {
-            const vs::MemoryObjectSet &objects = sharing->processGroupToObjects().at(*group);
+        for (const auto *entry : groups) {
+            const VSProcessGroup *group = &entry->first;
+            const vs::MemoryObjectSet &objects = entry->second;
             // A shared group's table is the same for every member that
             // prints it: build it once.
             std::unique_ptr<GroupTable> privateTable;

@@ -10,9 +10,17 @@ VSMemoryCategory::VSMemoryCategory(std::string name, VSSegmentKind segment)
 
 void VSMemoryCategory::addMemoryObject(VSMemoryObject *object) {
     VS_ASSERT(object != nullptr);
-    if (!_memoryObjects.insert(object)) {
-        return;
+    if (_memoryObjects.insert(object)) {
+        _addTotalsAndRegions(object);
     }
+}
+
+void VSMemoryCategory::addNewMemoryObject(VSMemoryObject *object) {
+    _memoryObjects.appendNew(object);
+    _addTotalsAndRegions(object);
+}
+
+void VSMemoryCategory::_addTotalsAndRegions(VSMemoryObject *object) {
     _totalDirtySize += object->totalDirtySize();
     _totalSwappedSize += object->totalSwappedSize();
     _totalCleanSize += object->totalCleanSize();

@@ -23,6 +23,9 @@ public:
     // Adds the object once: its five totals to the category's and its
     // regions to the category's region set. A second addition does nothing.
     void addMemoryObject(VSMemoryObject *object);
+    // The same for an object the caller knows is not in the category yet
+    // (each object of a table goes to one category): no lookup.
+    void addNewMemoryObject(VSMemoryObject *object);
 
     const std::string &name() const { return _name; }
     const vs::MemoryObjectSet &memoryObjects() const { return _memoryObjects; }
@@ -42,6 +45,8 @@ public:
     bool purgeableNonVolatile() const;
 
 private:
+    void _addTotalsAndRegions(VSMemoryObject *object);
+
     std::string _name;
     vs::MemoryObjectSet _memoryObjects;
     std::uint64_t _totalDirtySize = 0;

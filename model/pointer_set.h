@@ -58,30 +58,30 @@ public:
         if (const std::size_t found = indexOf(p); found != kNotFound) {
             return {found, false};
         }
+        appendNew(p);
+        if (_large && _large->indexed + 1 == _large->items.size() && !_large->slots.empty()) {
+            _large->placeNew(); // keep an index that is up to date so
+        }
+        return {size() - 1, true};
+    }
+
+    // Adds p, which the caller knows is not a member yet: no lookup. The
+    // index, if any, catches up at the next lookup.
+    void appendNew(T *p) {
+        VS_ASSERT(p != nullptr);
         if (!_large && _one == nullptr) {
             _one = p;
-            return {0, true};
+            return;
         }
-        Large &large = _makeLarge(4);
-        large.items.push_back(p);
-        const std::size_t index = large.items.size() - 1;
-        if (!large.slots.empty()) {
-            if (large.items.size() * 2 > large.slots.size()) {
-                large.rebuildIndex(large.slots.size() * 2);
-            } else {
-                large.place(index);
-            }
-        } else if (large.items.size() > kLinearLimit) {
-            large.rebuildIndex(64);
-        }
-        return {index, true};
+        _makeLarge(4).items.push_back(p);
     }
 
     static constexpr std::size_t kNotFound = static_cast<std::size_t>(-1);
 
     // p's position in the order of first addition, or kNotFound.
     std::size_t indexOf(const T *p) const {
-        if (_large && !_large->slots.empty()) {
+        if (_large && _large->items.size() > kLinearLimit) {
+            _large->catchUp();
             const std::vector<std::uint32_t> &slots = _large->slots;
             const std::size_t mask = slots.size() - 1;
             for (std::size_t i = _slotFor(p, mask);; i = (i + 1) & mask) {
@@ -121,6 +121,7 @@ public:
         Large &large = _makeLarge(count);
         large.items.reserve(count);
         large.rebuildIndex(slots);
+        large.indexed = large.items.size();
     }
 
     // Adds every member of other, keeping other's order for the new ones.
@@ -145,12 +146,17 @@ private:
         return static_cast<std::size_t>(((bits >> 3) * 0x9E3779B97F4A7C15ull) >> 32) & mask;
     }
 
-    // The members of a set of more than one, and their index.
+    // The members of a set of more than one, and their index. The index is
+    // made when a lookup first needs it and follows the list lazily: sets
+    // that are only filled with known new members and then read never
+    // build one.
     struct Large {
         std::vector<T *> items;
         // Empty, or a power-of-two table at most half full: 0 is a free
         // slot, anything else a position in items plus one.
         std::vector<std::uint32_t> slots;
+        // How many of items are placed in slots.
+        std::size_t indexed = 0;
 
         void place(std::size_t index) {
             const std::size_t mask = slots.size() - 1;
@@ -166,6 +172,35 @@ private:
             for (std::size_t index = 0; index < items.size(); ++index) {
                 place(index);
             }
+        }
+
+        // Places the newest member, growing the table when it is half full.
+        void placeNew() {
+            if (items.size() * 2 > slots.size()) {
+                rebuildIndex(slots.size() * 2);
+            } else {
+                place(items.size() - 1);
+            }
+            indexed = items.size();
+        }
+
+        // Brings the index up to the list.
+        void catchUp() {
+            if (indexed == items.size() && !slots.empty()) {
+                return;
+            }
+            std::size_t count = slots.empty() ? 64 : slots.size();
+            while (count < items.size() * 2) {
+                count *= 2;
+            }
+            if (count != slots.size()) {
+                rebuildIndex(count);
+            } else {
+                for (std::size_t index = indexed; index < items.size(); ++index) {
+                    place(index);
+                }
+            }
+            indexed = items.size();
         }
     };
 
