@@ -10,19 +10,23 @@ namespace {
 // Sets of every size the representation changes at: empty, one inline
 // member, a few searched linearly, just past the linear limit, and large
 // enough for the index to grow several times; each with and without room
-// reserved first (before any member, and after the first one).
+// reserved first (before any member, and after the first one), and with the
+// first half added as known new members, whose index catches up later.
 TEST(PointerSet, KeepsFirstAdditionOrderAndFindsEveryMember) {
     struct Case {
         std::size_t members;
         std::size_t reserveBefore; // 0: none
         bool reserveAfterFirst;
+        bool appendFirstHalf = false;
     };
     const Case cases[] = {{0, 0, false},   {1, 0, false},  {1, 100, false}, {2, 0, false},  {16, 0, false},
                           {17, 0, false},  {17, 40, false}, {18, 0, true},   {300, 0, false}, {300, 1000, false},
-                          {1000, 0, true}, {5000, 64, false}};
+                          {1000, 0, true}, {5000, 64, false}, {17, 0, false, true}, {40, 0, false, true},
+                          {300, 1000, false, true},        {5000, 64, false, true}};
     for (const Case &c : cases) {
         SCOPED_TRACE(testing::Message() << c.members << " members, reserve " << c.reserveBefore
-                                        << (c.reserveAfterFirst ? " after first" : ""));
+                                        << (c.reserveAfterFirst ? " after first" : "")
+                                        << (c.appendFirstHalf ? ", first half appended" : ""));
         std::vector<int> storage(c.members + 1);
         // An order unlike the addresses', so that the index is what finds them.
         std::vector<int *> order;
@@ -34,6 +38,11 @@ TEST(PointerSet, KeepsFirstAdditionOrderAndFindsEveryMember) {
             set.reserve(c.reserveBefore);
         }
         for (std::size_t i = 0; i < order.size(); ++i) {
+            if (c.appendFirstHalf && i < order.size() / 2) {
+                set.appendNew(order[i]);
+                EXPECT_EQ(set.size(), i + 1);
+                continue;
+            }
             const auto [index, added] = set.insertIndex(order[i]);
             EXPECT_TRUE(added);
             EXPECT_EQ(index, i);
