@@ -59,9 +59,6 @@ public:
             return {found, false};
         }
         appendNew(p);
-        if (_large && _large->indexed + 1 == _large->items.size() && !_large->slots.empty()) {
-            _large->placeNew(); // keep an index that is up to date so
-        }
         return {size() - 1, true};
     }
 
@@ -121,7 +118,6 @@ public:
         Large &large = _makeLarge(count);
         large.items.reserve(count);
         large.rebuildIndex(slots);
-        large.indexed = large.items.size();
     }
 
     // Adds every member of other, keeping other's order for the new ones.
@@ -172,19 +168,11 @@ private:
             for (std::size_t index = 0; index < items.size(); ++index) {
                 place(index);
             }
-        }
-
-        // Places the newest member, growing the table when it is half full.
-        void placeNew() {
-            if (items.size() * 2 > slots.size()) {
-                rebuildIndex(slots.size() * 2);
-            } else {
-                place(items.size() - 1);
-            }
             indexed = items.size();
         }
 
-        // Brings the index up to the list.
+        // Brings the index up to the list, doubling the table while it
+        // would be more than half full.
         void catchUp() {
             if (indexed == items.size() && !slots.empty()) {
                 return;
@@ -195,12 +183,11 @@ private:
             }
             if (count != slots.size()) {
                 rebuildIndex(count);
-            } else {
-                for (std::size_t index = indexed; index < items.size(); ++index) {
-                    place(index);
-                }
+                return;
             }
-            indexed = items.size();
+            for (; indexed < items.size(); ++indexed) {
+                place(indexed);
+            }
         }
     };
 

@@ -284,12 +284,6 @@ int32_t VSLinuxPlatform::list_all_pids(std::span<int32_t> buffer) {
     return static_cast<int32_t>(stored);
 }
 
-std::shared_ptr<VSLinuxPlatform::Listed> VSLinuxPlatform::_listedFor(int32_t pid) {
-    std::lock_guard<std::mutex> lock(_listedMutex);
-    auto it = _listed.find(pid);
-    return it == _listed.end() ? nullptr : it->second;
-}
-
 int32_t VSLinuxPlatform::pid_bsd_info(int32_t pid, VSBsdInfo &info) {
     info = VSBsdInfo{};
     if (pid == 0) {
@@ -304,13 +298,16 @@ int32_t VSLinuxPlatform::pid_bsd_info(int32_t pid, VSBsdInfo &info) {
     // The stat the listing read moments ago serves once; asked again, the
     // record is read anew.
     std::optional<vs::ProcStat> st;
-    UniqueFd ownDir;
-    int dirFd = -1;
-    if (std::shared_ptr<Listed> listed = _listedFor(pid)) {
+    std::shared_ptr<Listed> listed; // keeps its directory open while in use
+    {
         std::lock_guard<std::mutex> lock(_listedMutex);
-        st.swap(listed->stat);
-        dirFd = listed->dir.get();
+        if (auto it = _listed.find(pid); it != _listed.end()) {
+            listed = it->second;
+            st.swap(listed->stat);
+        }
     }
+    UniqueFd ownDir;
+    int dirFd = listed ? listed->dir.get() : -1;
     if (dirFd < 0) {
         ownDir = UniqueFd(openProc(pid, O_RDONLY | O_DIRECTORY));
         dirFd = ownDir.get();

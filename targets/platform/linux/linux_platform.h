@@ -122,7 +122,6 @@ private:
     struct Listed;
     std::mutex _listedMutex;
     std::unordered_map<int32_t, std::shared_ptr<Listed>> _listed;
-    std::shared_ptr<Listed> _listedFor(int32_t pid);
 
     // Files kept open to save opening them again only get fds below this.
     int _keptFdLimit = 512;

@@ -59,7 +59,11 @@ ReadBuffer &threadReadBuffer() {
     return buffer;
 }
 
-int readAll(int fd, ReadBuffer &buffer, std::string_view &text, size_t chunk) {
+namespace {
+
+// Reads from offset 0 until a read returns nothing or, for files the kernel
+// makes in one piece, until a read does not fill what it was given.
+int readFrom(int fd, ReadBuffer &buffer, std::string_view &text, size_t chunk, bool shortReadEnds) {
     if (buffer.capacity() == 0) {
         buffer.reserve(kInitialBuffer);
     }
@@ -68,58 +72,49 @@ int readAll(int fd, ReadBuffer &buffer, std::string_view &text, size_t chunk) {
         if (used == buffer.capacity()) {
             buffer.reserve(buffer.capacity() * 2); // keeps what was read
         }
-        const ssize_t n = ::pread(fd, buffer.data() + used, std::min(chunk, buffer.capacity() - used),
-                                  static_cast<off_t>(used));
+        const size_t asked = std::min(chunk, buffer.capacity() - used);
+        const ssize_t n = ::pread(fd, buffer.data() + used, asked, static_cast<off_t>(used));
         if (n < 0) {
             if (errno == EINTR) {
                 continue;
             }
             return errno;
         }
-        if (n == 0) {
+        used += static_cast<size_t>(n);
+        if (n == 0 || (shortReadEnds && static_cast<size_t>(n) < asked)) {
             break;
         }
-        used += static_cast<size_t>(n);
     }
     text = std::string_view(buffer.data(), used);
     return 0;
 }
 
-int readFileAt(int dirFd, const char *name, ReadBuffer &buffer, std::string_view &text) {
+int readOpened(int dirFd, const char *name, ReadBuffer &buffer, std::string_view &text, bool shortReadEnds) {
     const int fd = ::openat(dirFd, name, O_RDONLY | O_CLOEXEC);
     if (fd < 0) {
         return errno;
     }
-    const int error = readAll(fd, buffer, text);
+    const int error = readFrom(fd, buffer, text, SIZE_MAX, shortReadEnds);
     ::close(fd);
     return error;
+}
+
+} // namespace
+
+int readAll(int fd, ReadBuffer &buffer, std::string_view &text, size_t chunk) {
+    return readFrom(fd, buffer, text, chunk, false);
+}
+
+int readFileAt(int dirFd, const char *name, ReadBuffer &buffer, std::string_view &text) {
+    return readOpened(dirFd, name, buffer, text, false);
 }
 
 int readFileAt(int dirFd, const char *name, std::string_view &text) {
-    return readFileAt(dirFd, name, threadReadBuffer(), text);
+    return readOpened(dirFd, name, threadReadBuffer(), text, false);
 }
 
 int readOnePieceFileAt(int dirFd, const char *name, std::string_view &text) {
-    const int fd = ::openat(dirFd, name, O_RDONLY | O_CLOEXEC);
-    if (fd < 0) {
-        return errno;
-    }
-    ReadBuffer &buffer = threadReadBuffer();
-    if (buffer.capacity() == 0) {
-        buffer.reserve(kInitialBuffer);
-    }
-    ssize_t n;
-    do {
-        n = ::pread(fd, buffer.data(), buffer.capacity(), 0);
-    } while (n < 0 && errno == EINTR);
-    int error = n < 0 ? errno : 0;
-    if (n >= 0 && static_cast<size_t>(n) < buffer.capacity()) {
-        text = std::string_view(buffer.data(), static_cast<size_t>(n));
-    } else if (n >= 0) {
-        error = readAll(fd, buffer, text); // larger than the buffer after all
-    }
-    ::close(fd);
-    return error;
+    return readOpened(dirFd, name, threadReadBuffer(), text, true);
 }
 
 int64_t readBytesAt(int dirFd, const char *name, uint64_t offset, void *out, size_t size) {
