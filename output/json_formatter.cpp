@@ -1,21 +1,16 @@
 #include "output/json_formatter.h"
 
-#include <cerrno>
 #include <cstdio>
-#include <cstring>
 #include <exception>
-#include <filesystem>
 #include <optional>
-#include <random>
 
 #include "analysis/vestage.h"
 #include "model/aux_data.h"
+#include "targets/platform/files.h"
 #include "targets/platform/platform.h"
 #include "targets/process.h"
 
 namespace {
-
-namespace fs = std::filesystem;
 
 // The six figures of one category, or of the totals under "summary".
 nlohmann::json sizesObject(std::uint64_t dirtyAndSwapped, std::uint64_t swapped, std::uint64_t clean,
@@ -32,125 +27,6 @@ nlohmann::json sizesObject(std::uint64_t dirtyAndSwapped, std::uint64_t swapped,
 
 void reportWriteFailure(const std::string &reason) {
     std::fprintf(stderr, "Unable to serialize/write JSON data due to error: %s\n", reason.c_str());
-}
-
-// errno as left by a failed stdio call; stdio may leave it unset on a short
-// write, and the report must still name some reason.
-int lastError() { return errno != 0 ? errno : EIO; }
-
-// Writes all of contents and closes the stream. Returns the error, if any;
-// the stream is closed either way.
-std::optional<int> writeAndClose(std::FILE *stream, const std::string &contents) {
-    errno = 0;
-    const std::size_t written = std::fwrite(contents.data(), 1, contents.size(), stream);
-    std::optional<int> error;
-    if (written != contents.size() || std::fflush(stream) != 0) {
-        error = lastError();
-    }
-    // Closing reports what the final flush met (a full disk, a quota).
-    errno = 0;
-    if (std::fclose(stream) != 0 && !error) {
-        error = lastError();
-    }
-    return error;
-}
-
-std::optional<int> writeInPlace(const fs::path &file, const std::string &contents) {
-    errno = 0;
-    std::FILE *stream = std::fopen(file.c_str(), "w");
-    if (stream == nullptr) {
-        return lastError();
-    }
-    return writeAndClose(stream, contents);
-}
-
-std::string randomSuffix() {
-    std::uint64_t seed = 0;
-    try {
-        seed = (static_cast<std::uint64_t>(std::random_device{}()) << 32) ^ std::random_device{}();
-    } catch (const std::exception &) {
-        // Without an entropy source the exclusive create still keeps names
-        // apart; it only takes more attempts.
-        seed = static_cast<std::uint64_t>(reinterpret_cast<std::uintptr_t>(&seed));
-    }
-    static thread_local std::mt19937_64 generator(seed);
-    char text[17];
-    std::snprintf(text, sizeof text, "%016llx", static_cast<unsigned long long>(generator()));
-    return text;
-}
-
-// Replaces file with a new one holding contents, through a temporary file
-// in the same directory (so that the rename stays on one file system and is
-// atomic). The temporary file never survives a failure.
-std::optional<int> replaceFile(const fs::path &file, const std::string &contents) {
-    std::error_code ignored;
-    const fs::file_status existing = fs::status(file, ignored);
-    const bool exists = fs::is_regular_file(existing);
-    if (exists) {
-        // Renaming over a file needs only a writable directory; keep the
-        // file's own protection meaningful by asking for write access first
-        // (append mode neither truncates nor changes the file).
-        errno = 0;
-        std::FILE *probe = std::fopen(file.c_str(), "a");
-        if (probe == nullptr) {
-            return lastError();
-        }
-        std::fclose(probe);
-    }
-
-    const fs::path directory = file.has_parent_path() ? file.parent_path() : fs::path(".");
-    // Hidden, and short enough to stay within the name limit whatever the
-    // target is called.
-    const std::string stem = "." + file.filename().string().substr(0, 200) + ".";
-    fs::path temporary;
-    std::FILE *stream = nullptr;
-    for (int attempt = 0; attempt < 100 && stream == nullptr; ++attempt) {
-        temporary = directory / (stem + randomSuffix() + ".tmp");
-        errno = 0;
-        stream = std::fopen(temporary.c_str(), "wx");
-        if (stream == nullptr && errno != EEXIST) {
-            return lastError();
-        }
-    }
-    if (stream == nullptr) {
-        return EEXIST;
-    }
-
-    if (std::optional<int> error = writeAndClose(stream, contents)) {
-        fs::remove(temporary, ignored);
-        return error;
-    }
-    if (exists) {
-        fs::permissions(temporary, existing.permissions(), fs::perm_options::replace, ignored);
-    }
-    errno = 0;
-    if (std::rename(temporary.c_str(), file.c_str()) != 0) {
-        const int error = lastError();
-        fs::remove(temporary, ignored);
-        return error;
-    }
-    return std::nullopt;
-}
-
-// Writes contents to path. A regular file (also one reached through
-// symbolic links) and a path that does not exist yet are replaced
-// atomically; anything else that exists cannot be replaced by a rename
-// (a terminal, a pipe, /dev/stdout) and is written in place, as is the
-// target of a dangling link.
-std::optional<int> writeDocument(const std::string &path, const std::string &contents) {
-    if (path.empty()) {
-        return ENOENT;
-    }
-    std::error_code error;
-    const fs::file_status status = fs::status(path, error);
-    if (fs::is_regular_file(status)) {
-        const fs::path real = fs::canonical(path, error);
-        return replaceFile(error ? fs::path(path) : real, contents);
-    }
-    if (status.type() == fs::file_type::not_found && !fs::is_symlink(fs::symlink_status(path, error))) {
-        return replaceFile(path, contents);
-    }
-    return writeInPlace(path, contents);
 }
 
 } // namespace
@@ -301,8 +177,8 @@ void VSOutputFormatterJSON::end() {
         return;
     }
     try {
-        if (std::optional<int> error = writeDocument(_path, document)) {
-            reportWriteFailure(std::strerror(*error));
+        if (std::optional<vs::FileFailure> failure = vs::writeOutputFile(_path, document, 0644)) {
+            reportWriteFailure(failure->reason);
         }
     } catch (const std::exception &exception) {
         // Only an exhausted memory gets here; the run still ends normally.

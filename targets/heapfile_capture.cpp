@@ -1,12 +1,10 @@
 #include "targets/heapfile_capture.h"
 
+#include "targets/platform/files.h"
+
 #include <algorithm>
-#include <cerrno>
 #include <cstdio>
-#include <cstring>
-#include <filesystem>
 #include <random>
-#include <system_error>
 #include <vector>
 
 #include "model/image.h"
@@ -255,45 +253,12 @@ std::string heapfileFileName(const VSHeapfileSnapshot &snapshot) {
 }
 
 bool writeFileAtomically(const std::string &path, const std::string &text, HeapfileError *error) {
-    auto fail = [&](const std::string &what, int number) {
-        if (error != nullptr) {
-            *error = {std::string(kPosixErrorDomain), number, what + ": " + std::strerror(number)};
-        }
-        return false;
-    };
-    std::random_device random;
-    std::string temporary;
-    std::FILE *file = nullptr;
-    // "x": never reuse a file someone else created under the same name.
-    for (int attempt = 0; attempt < 8 && file == nullptr; ++attempt) {
-        char suffix[24];
-        std::snprintf(suffix, sizeof(suffix), ".tmp%08x", static_cast<unsigned>(random()));
-        temporary = path + suffix;
-        errno = 0;
-        file = std::fopen(temporary.c_str(), "wbx");
-        if (file == nullptr && errno != EEXIST) {
-            return fail("cannot create " + temporary, errno != 0 ? errno : EIO);
-        }
+    // A heapfile holds the layout of a process's memory: for the caller only.
+    const std::optional<FileFailure> failure = writeOutputFile(path, text, 0600);
+    if (failure && error != nullptr) {
+        *error = {std::string(kPosixErrorDomain), failure->error, failure->reason};
     }
-    if (file == nullptr) {
-        return fail("cannot create a temporary file next to " + path, EEXIST);
-    }
-    errno = 0;
-    const bool written = std::fwrite(text.data(), 1, text.size(), file) == text.size();
-    int number = errno;
-    const bool closed = std::fclose(file) == 0;
-    if (!written || !closed) {
-        number = number != 0 ? number : (errno != 0 ? errno : EIO);
-        std::remove(temporary.c_str());
-        return fail("cannot write " + temporary, number);
-    }
-    std::error_code renameError;
-    std::filesystem::rename(temporary, path, renameError);
-    if (renameError) {
-        std::remove(temporary.c_str());
-        return fail("cannot rename " + temporary + " to " + path, renameError.value());
-    }
-    return true;
+    return !failure;
 }
 
 }  // namespace vs
