@@ -6,6 +6,7 @@
 #include <nlohmann/json.hpp>
 
 #include "model/memory_region.h"
+#include "model/utf8.h"
 #include "targets/platform/platform.h"
 
 using nlohmann::json;
@@ -17,13 +18,55 @@ namespace {
 // parsing keeps a hostile file from costing unbounded work.
 constexpr int kMaxNesting = 16;
 
+// Exact bytes of a text, two lower-case hex digits each.
+std::string toHex(std::string_view bytes) {
+    static constexpr char kDigits[] = "0123456789abcdef";
+    std::string out;
+    out.reserve(bytes.size() * 2);
+    for (const char c : bytes) {
+        out += kDigits[static_cast<unsigned char>(c) >> 4];
+        out += kDigits[static_cast<unsigned char>(c) & 0xF];
+    }
+    return out;
+}
+
+std::optional<std::string> fromHex(std::string_view digits) {
+    auto value = [](char c) -> int {
+        if (c >= '0' && c <= '9') return c - '0';
+        if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+        if (c >= 'A' && c <= 'F') return c - 'A' + 10;
+        return -1;
+    };
+    if (digits.size() % 2 != 0) {
+        return std::nullopt;
+    }
+    std::string bytes;
+    bytes.reserve(digits.size() / 2);
+    for (size_t i = 0; i < digits.size(); i += 2) {
+        const int high = value(digits[i]);
+        const int low = value(digits[i + 1]);
+        if (high < 0 || low < 0) {
+            return std::nullopt;
+        }
+        bytes.push_back(static_cast<char>(high << 4 | low));
+    }
+    return bytes;
+}
+
 std::string hex(uint64_t value) {
     char buffer[24];
     std::snprintf(buffer, sizeof(buffer), "0x%" PRIx64, value);
     return buffer;
 }
 
-std::string jsonQuoted(std::string_view text) { return json(std::string(text)).dump(); }
+// Texts from the system need not be valid UTF-8 (Linux names are bytes):
+// such bytes become U+FFFD rather than failing the whole document.
+template <typename Json>
+std::string jsonText(const Json &value) {
+    return value.dump(-1, ' ', false, Json::error_handler_t::replace);
+}
+
+std::string jsonQuoted(std::string_view text) { return jsonText(json(std::string(text))); }
 
 // Depth of [ and { outside strings, or -1 past kMaxNesting.
 int maximumNesting(std::string_view bytes) {
@@ -154,7 +197,7 @@ public:
             fail(vs::kHeapfileErrorBadValue, _name(key) + " is not a string (" + _describe(*value) + ")");
             return std::nullopt;
         }
-        return value->get<std::string>();
+        return _exactBytes(key, value->get<std::string>());
     }
 
     // An optional string: absent and null both mean "none". The outer
@@ -168,10 +211,30 @@ public:
             fail(vs::kHeapfileErrorBadValue, _name(key) + " is not a string (" + _describe(*found) + ")");
             return std::nullopt;
         }
-        return std::optional<std::string>(found->get<std::string>());
+        const std::optional<std::string> exact = _exactBytes(key, found->get<std::string>());
+        if (!exact) {
+            return std::nullopt;
+        }
+        return std::optional<std::string>(*exact);
     }
 
 private:
+    // A text that was not UTF-8 when written comes with its exact bytes
+    // under KEYBytes (hex): those win over the readable form.
+    std::optional<std::string> _exactBytes(const char *key, std::string readable) {
+        const std::string bytesKey = std::string(key) + "Bytes";
+        const auto found = _object.find(bytesKey);
+        if (found == _object.end()) {
+            return readable;
+        }
+        std::optional<std::string> bytes = found->is_string() ? fromHex(found->get_ref<const std::string &>())
+                                                              : std::nullopt;
+        if (!bytes) {
+            fail(vs::kHeapfileErrorBadValue, _name(bytesKey.c_str()) + " is not hex digits (" + _describe(*found) + ")");
+        }
+        return bytes;
+    }
+
     const json *_find(const char *key) {
         if (_failed) {
             return nullptr;
@@ -332,6 +395,11 @@ std::optional<VSHeapfileSnapshot> parseHeapfile(std::string_view bytes, Heapfile
                      "not a JSON document (syntax error at byte " + std::to_string(failure.byte) + ")");
         }
         return std::nullopt;
+    } catch (const json::exception &failure) {
+        // A well-formed document the library still refuses, e.g. a number
+        // beyond the range of a double.
+        setError(error, kHeapfileErrorSyntax, std::string("not a usable JSON document (") + failure.what() + ")");
+        return std::nullopt;
     }
     if (!document.is_object()) {
         setError(error, kHeapfileErrorNotHeapfile, "not a vestage heapfile (the document is not a JSON object)");
@@ -422,14 +490,20 @@ std::string heapfileText(const VSHeapfileSnapshot &snapshot) {
         out += "  \"";
         out += key;
         out += "\": ";
-        out += value.dump();
+        out += jsonText(value);
         out += last ? "\n" : ",\n";
     };
     line("format", std::string(kHeapfileFormatName));
     line("version", kHeapfileVersion);
     line("pid", snapshot.pid);
     line("name", snapshot.name);
+    if (!isUtf8(snapshot.name)) {
+        line("nameBytes", toHex(snapshot.name));
+    }
     line("description", snapshot.description);
+    if (!isUtf8(snapshot.description)) {
+        line("descriptionBytes", toHex(snapshot.description));
+    }
     line("pointerWidth", snapshot.is64bit ? 64 : 32);
     line("pageSize", snapshot.pageSize);
     line("physVestage", snapshot.physVestage);
@@ -443,11 +517,17 @@ std::string heapfileText(const VSHeapfileSnapshot &snapshot) {
         object["length"] = hex(region.length);
         object["type"] = region.type;
         object["path"] = region.path ? json(*region.path) : json(nullptr);
+        if (region.path && !isUtf8(*region.path)) {
+            object["pathBytes"] = toHex(*region.path);
+        }
         object["protection"] = region.protection;
         object["maxProtection"] = region.maxProtection;
         object["userTag"] = region.userTag;
         if (region.userTagName) {
             object["userTagName"] = *region.userTagName;
+            if (!isUtf8(*region.userTagName)) {
+                object["userTagNameBytes"] = toHex(*region.userTagName);
+            }
         }
         object["residentBytes"] = region.residentBytes;
         object["sharedNowPrivateBytes"] = region.sharedNowPrivateBytes;
@@ -460,9 +540,7 @@ std::string heapfileText(const VSHeapfileSnapshot &snapshot) {
         object["objectId"] = region.objectId;
         object["purgeableState"] = region.purgeableState;
         out += index == 0 ? "\n    " : ",\n    ";
-        // Invalid UTF-8 in a path (Linux paths are bytes) is replaced rather
-        // than refused: a snapshot is still worth writing.
-        out += object.dump(-1, ' ', false, json::error_handler_t::replace);
+        out += jsonText(object);
     }
     out += snapshot.regions.empty() ? "]\n" : "\n  ]\n";
     out += "}\n";

@@ -8,15 +8,12 @@
 
 #include "model/assert.h"
 #include "model/image.h"
+#include "targets/platform/files.h"
 
 namespace {
 
 constexpr int64_t kErrorUnknownInitialization = 1;
 constexpr int64_t kErrorUnknownPlatform = 2;
-
-vs::HeapfileError systemError(int number) {
-    return {std::string(vs::kPosixErrorDomain), number, std::strerror(number)};
-}
 
 // Record counters are 32-bit; a count that does not fit is held at the top
 // rather than wrapped into a small one.
@@ -30,31 +27,10 @@ uint32_t saturated(uint64_t value) {
 namespace vs {
 
 std::optional<std::string> readWholeFile(const std::string &path, HeapfileError *error) {
-    errno = 0;
-    std::FILE *file = std::fopen(path.c_str(), "rb");
-    if (file == nullptr) {
-        if (error != nullptr) {
-            *error = systemError(errno != 0 ? errno : EIO);
-        }
-        return std::nullopt;
-    }
-    std::string bytes;
-    char buffer[1 << 16];
-    while (true) {
-        const size_t got = std::fread(buffer, 1, sizeof(buffer), file);
-        bytes.append(buffer, got);
-        if (got < sizeof(buffer)) {
-            break;
-        }
-    }
-    // A directory opens fine and fails only on reading.
-    const int readError = std::ferror(file) ? (errno != 0 ? errno : EIO) : 0;
-    std::fclose(file);
-    if (readError != 0) {
-        if (error != nullptr) {
-            *error = systemError(readError);
-        }
-        return std::nullopt;
+    FileFailure failure;
+    std::optional<std::string> bytes = readRegularFile(path, kMaxHeapfileSize, failure);
+    if (!bytes && error != nullptr) {
+        *error = {std::string(kPosixErrorDomain), failure.error, failure.reason};
     }
     return bytes;
 }

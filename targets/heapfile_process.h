@@ -71,9 +71,12 @@ private:
 
 namespace vs {
 
-// Reads a whole file. nullopt with the system's error (domain
-// kPosixErrorDomain, the errno as code, its text as description) when it
-// cannot be read.
+// The largest heapfile read: a million regions at about 400 bytes each.
+inline constexpr uint64_t kMaxHeapfileSize = uint64_t{1} << 30;
+
+// Reads a whole heapfile: a regular file of at most kMaxHeapfileSize bytes.
+// nullopt with the system's error (domain kPosixErrorDomain, the errno as
+// code, a printable reason as description) when it cannot be read.
 std::optional<std::string> readWholeFile(const std::string &path, HeapfileError *error);
 
 }  // namespace vs

@@ -5,6 +5,7 @@
 // own name), so they are compared as one sum per image.
 
 #include <array>
+#include <filesystem>
 #include <map>
 
 #include "analysis/vestage.h"
@@ -34,9 +35,16 @@ std::map<std::string, std::array<uint64_t, 6>> categoriesOf(std::unique_ptr<VSPr
     return figures;
 }
 
+// The child runs from a program whose name is not UTF-8 and holds a control character: it is captured all the
+// same, and its name and paths arrive byte for byte.
 TEST(HeapfileRoundTrip, CategoryTotalsOfAHeapfileMatchTheLiveProcess) {
+    vs::test::ScratchDir programs;
+    const std::string program = programs.path + "/mem\xff\x1b" "child";
+    std::filesystem::copy_file(VESTAGE_TEST_BIN_DIR "/vs_memchild", program);
+    std::filesystem::permissions(program, std::filesystem::perms::owner_all);
     vs::test::MemChild child({"anon:private:16:10", "file:data:" VESTAGE_SOURCE_DIR "/CMakeLists.txt",
-                              "shared:common:4", "exec:jit:2", "none:fence:2", "thread:worker", "libc:libc"});
+                              "shared:common:4", "exec:jit:2", "none:fence:2", "thread:worker", "libc:libc"},
+                             program);
     ASSERT_TRUE(child.ready());
     VSLinuxPlatform linux;
     const struct Restore {
@@ -58,6 +66,9 @@ TEST(HeapfileRoundTrip, CategoryTotalsOfAHeapfileMatchTheLiveProcess) {
     std::unique_ptr<VSHeapfileProcess> heapfile = VSHeapfileProcess::processWithHeapfile(path, &error);
     ASSERT_NE(heapfile, nullptr) << error.description;
     EXPECT_EQ(heapfile->pid(), child.pid());
+    EXPECT_EQ(heapfile->name(), "mem\xff\x1b" "child");
+    EXPECT_EQ(std::filesystem::status(path).permissions(), std::filesystem::perms::owner_read |
+                                                               std::filesystem::perms::owner_write);
 
     EXPECT_EQ(categoriesOf(std::move(heapfile)), liveFigures);
     // The arrangement is visible at all: private memory, a shared mapping,

@@ -3,8 +3,12 @@
 
 #include <gtest/gtest.h>
 
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <cerrno>
 #include <cstring>
+#include <fstream>
 
 #include "targets/heapfile_capture.h"
 #include "tests/targets/heapfile_test_support.h"
@@ -121,15 +125,28 @@ TEST_F(HeapfileProcessTest, TheWalkRebuildsImagesNamesRegionsAndKeepsTheRecorded
               std::tuple(VSSegmentText, VSSegmentData, VSSegmentLinkedit, VSSegmentNone));
 }
 
+// Only regular files of a bounded size are read: a device would be read until memory runs out, a FIFO would
+// block the run in open(). Numbers the JSON library refuses are the file's error, not an abort.
 TEST_F(HeapfileProcessTest, FilesThatCannotBeLoadedSayWhy) {
     ScratchFile bad("{\"format\": \"vestage-heapfile\", \"version\": 1");
+    ScratchFile overflowing("[-1e400]");
     ScratchFile unknownPlatform(vs::heapfileText(snapshotOf({}, "arm64 in lower case")));
+    const std::string fifo = bad.directory() + "/fifo";
+    ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
+    const std::string huge = bad.directory() + "/huge.heap";
+    std::ofstream{huge}.close();
+    ASSERT_EQ(::truncate(huge.c_str(), int64_t(vs::kMaxHeapfileSize) + 1), 0);  // sparse: no disk needed
     using vs::kPosixErrorDomain, vs::kHeapfileErrorDomain, vs::kVestageErrorDomain;
     const std::vector<std::tuple<std::string, std::string_view, int64_t, std::string, std::string>> cases = {
         {bad.directory() + "/missing", kPosixErrorDomain, ENOENT, std::strerror(ENOENT), ""},
-        {bad.directory(), kPosixErrorDomain, EISDIR, std::strerror(EISDIR), ""},
+        {bad.directory(), kPosixErrorDomain, EISDIR, "a directory, not a regular file", ""},
+        {"/dev/zero", kPosixErrorDomain, EINVAL, "a character device, not a regular file", ""},
+        {fifo, kPosixErrorDomain, EINVAL, "a FIFO, not a regular file", ""},
+        {huge, kPosixErrorDomain, EFBIG, "larger than 1024 MiB, the most vestage reads", ""},
         {bad.path(), kHeapfileErrorDomain, vs::kHeapfileErrorSyntax,
          "the JSON document is truncated (it ends after 43 bytes)", ""},
+        {overflowing.path(), kHeapfileErrorDomain, vs::kHeapfileErrorSyntax,
+         "not a usable JSON document ([json.exception.out_of_range.406] number overflow parsing '-1e400')", ""},
         {unknownPlatform.path(), kVestageErrorDomain, 2,
          "Unable to determine platform from memory graph process description",
          "Unable to determine platform architecture of target\n"},
