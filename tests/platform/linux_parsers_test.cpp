@@ -101,10 +101,26 @@ TEST(LinuxProcText, SmapsAndStatEdgeCases) {
     }
 }
 
+// The mount table tells tmpfs files (shmem) apart, and which file systems a header probe may open: never one whose
+// server may not answer.
 TEST(LinuxProcText, MappingKinds) {
-    const std::vector<uint64_t> tmpfs = vs::parseTmpfsDevices("22 1 254:0 / / rw - ext4 /dev/vda rw\n"
-                                                              "40 22 0:45 / /run/a\\040b rw - tmpfs none rw\n");
+    std::vector<uint64_t> tmpfs;
+    std::vector<std::string> probed;
+    for (const vs::MountDevice &mount : vs::parseMountDevices("22 1 254:0 / / rw - ext4 /dev/vda rw\n"
+                                                              "40 22 0:45 / /run/a\\040b rw - tmpfs none rw\n"
+                                                              "41 22 0:46 / /mnt/n rw - nfs4 srv:/x rw\n"
+                                                              "42 22 0:47 / /mnt/s rw - fuse.sshfs u@h: rw\n"
+                                                              "43 22 0:48 / /mnt/f rw - fuseblk /dev/sdb1 rw\n"
+                                                              "44 22 7:0 / /snap/a rw - squashfs /dev/loop0 ro\n")) {
+        if (mount.type == "tmpfs") {
+            tmpfs.push_back(mount.device);
+        }
+        if (vs::mayProbeFileSystem(mount.type)) {
+            probed.push_back(mount.type);
+        }
+    }
     ASSERT_EQ(tmpfs, std::vector<uint64_t>{45});
+    EXPECT_EQ(probed, (std::vector<std::string>{"ext4", "tmpfs", "squashfs"}));
     const std::pair<const char *, vs::MappingKind> cases[] = {
         {"1000-2000 rw-p 00000000 00:00 0 ", vs::MappingKind::Anonymous},
         {"1000-2000 r--p 00000000 00:00 0 [vvar_vclock]", vs::MappingKind::Special},

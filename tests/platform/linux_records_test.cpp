@@ -191,14 +191,95 @@ TEST(LinuxElfImages, ProgramHeaderParsing) {
     EXPECT_EQ(info->loads[0].vaddr, 0x400000u) << "loads are sorted by address";
     EXPECT_EQ(info->relroVaddr, 0x402000u);
 
+    // A load claiming the top of the address space belongs to no process and is dropped.
+    Elf64_Ehdr two = header;
+    two.e_phnum = 2;
+    const std::string wrapping = std::string(reinterpret_cast<const char *>(&two), sizeof two) +
+                                 phdr(PT_LOAD, 0x400000, 0x100, PF_R) + phdr(PT_LOAD, UINT64_MAX - 0xfff, 0x2000, PF_R);
+    const auto kept = vs::parseElfProgramHeaders(wrapping, needed);
+    ASSERT_TRUE(kept.has_value());
+    EXPECT_EQ(kept->loads.size(), 1u);
+
+    // A header anyone may have written: a table offset near 2^64 must not wrap past the bounds check.
+    auto withTableAt = [&](uint64_t offset) {
+        Elf64_Ehdr crafted = header;
+        crafted.e_phoff = offset;
+        return std::string(reinterpret_cast<const char *>(&crafted), sizeof crafted) + image.substr(sizeof crafted);
+    };
     const std::tuple<const char *, std::string, uint64_t> failures[] = {
         {"not ELF", "#!/bin/sh\necho hi\n" + std::string(64, ' '), 0},
         {"too short", image.substr(0, 10), 0},
         {"headers beyond the bytes read", image.substr(0, 100), whole},
+        {"table offset wrapping around", withTableAt(UINT64_MAX - 63), UINT64_MAX},
+        {"table offset past the end", withTableAt(image.size() + 8), image.size() + 8 + 3 * sizeof(Elf64_Phdr)},
     };
     for (const auto &[what, bytes, expectedNeeded] : failures) {
         EXPECT_FALSE(vs::parseElfProgramHeaders(bytes, needed).has_value()) << what;
         EXPECT_EQ(needed, expectedNeeded) << what;
+    }
+}
+
+// Which files a process's images are read from, and what a failed read leaves behind. Only a file mapped executable
+// somewhere can be an image: a data file is never read (opening one can start its writeback). A read that failed
+// (the process went away meanwhile) must not mark the file "not an image" for every later process of the run.
+TEST(LinuxElfImages, WhatIsReadForImages) {
+    Elf64_Ehdr header{};
+    std::memcpy(header.e_ident, ELFMAG, SELFMAG);
+    header.e_ident[EI_CLASS] = ELFCLASS64;
+    header.e_ident[EI_DATA] = ELFDATA2LSB;
+    header.e_phoff = sizeof header;
+    header.e_phentsize = sizeof(Elf64_Phdr);
+    header.e_phnum = 2;
+    const Elf64_Phdr loads[] = {{PT_LOAD, PF_R, 0, 0, 0, 0, 0x1000, 0},
+                                {PT_LOAD, PF_R | PF_X, 0x1000, 0x1000, 0, 0, 0x1000, 0}};
+    const std::string elf = std::string(reinterpret_cast<const char *>(&header), sizeof header) +
+                            std::string(reinterpret_cast<const char *>(loads), sizeof loads);
+    std::vector<SmapsRegion> regions;
+    vs::parseSmaps("10000-11000 r--p 00000000 fe:00 7 /usr/lib/libx.so\n"
+                   "11000-12000 r-xp 00001000 fe:00 7 /usr/lib/libx.so\n"
+                   "20000-21000 r--p 00000000 fe:00 8 /srv/data.bin\n"
+                   "30000-31000 rw-s 00000000 fe:00 9 /srv/shared.bin\n",
+                   regions);
+
+    struct Reads {
+        std::vector<uint64_t> inodes;
+        int failuresLeft = 0;
+        std::string contents;
+    } reads;
+    auto read = [](void *context, const SmapsRegion &region, uint64_t offset, void *out, size_t size) -> int64_t {
+        auto &r = *static_cast<Reads *>(context);
+        r.inodes.push_back(region.inode);
+        if (r.failuresLeft > 0) {
+            --r.failuresLeft;
+            return -ESRCH;
+        }
+        const size_t n = offset < r.contents.size() ? std::min(size, r.contents.size() - offset) : 0;
+        std::memcpy(out, r.contents.data() + offset, n);
+        return static_cast<int64_t>(n);
+    };
+    vs::ElfCache cache;
+    const struct Step {
+        const char *what;
+        int failures;
+        size_t images;
+        std::vector<uint64_t> inodesRead;
+    } steps[] = {
+        {"the process goes away while libx is read (through either mapping)", 2, 0, {7, 7}},
+        {"libx is read again, and only libx", 0, 1, {7}},
+        {"the next process finds it in the cache", 0, 1, {}},
+    };
+    for (const Step &step : steps) {
+        SCOPED_TRACE(step.what);
+        reads.inodes.clear();
+        reads.failuresLeft = step.failures;
+        reads.contents = elf;
+        const auto images = vs::processImages(regions, kPage, cache, read, &reads);
+        EXPECT_EQ(images.size(), step.images);
+        EXPECT_EQ(reads.inodes, step.inodesRead);
+        if (!images.empty()) {
+            EXPECT_EQ(images[0].path, "/usr/lib/libx.so");
+            EXPECT_EQ(images[0].segments.size(), 2u);
+        }
     }
 }
 

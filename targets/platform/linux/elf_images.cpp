@@ -6,6 +6,7 @@
 #include <cstring>
 #include <elf.h>
 #include <map>
+#include <set>
 
 namespace vs {
 
@@ -21,6 +22,16 @@ bool hostIsLittleEndian() {
     return first == 1;
 }
 
+// a + b, or UINT64_MAX when that does not fit: header fields are input
+// from files anyone may have written.
+uint64_t saturatingAdd(uint64_t a, uint64_t b) {
+    return a > UINT64_MAX - b ? UINT64_MAX : a + b;
+}
+
+// Highest address a segment may reach: anything above is no user mapping
+// and only a crafted header would claim it.
+constexpr uint64_t kAddressLimit = uint64_t{1} << 57;
+
 template <typename Ehdr, typename Phdr>
 std::optional<ElfProgramInfo> parseClass(std::string_view bytes, uint64_t &programHeaderEnd) {
     if (bytes.size() < sizeof(Ehdr)) {
@@ -32,17 +43,22 @@ std::optional<ElfProgramInfo> parseClass(std::string_view bytes, uint64_t &progr
         header.e_phnum == PN_XNUM) {
         return std::nullopt;
     }
-    programHeaderEnd =
-        static_cast<uint64_t>(header.e_phoff) + uint64_t{header.e_phnum} * header.e_phentsize;
-    if (programHeaderEnd > bytes.size()) {
+    // Both factors are 16-bit: the product fits; the offset may not.
+    const uint64_t tableOffset = header.e_phoff;
+    const uint64_t tableSize = uint64_t{header.e_phnum} * header.e_phentsize;
+    programHeaderEnd = saturatingAdd(tableOffset, tableSize);
+    if (tableOffset > bytes.size() || tableSize > bytes.size() - tableOffset) {
         return std::nullopt;
     }
     ElfProgramInfo info;
     info.is64bit = sizeof(Ehdr) == sizeof(Elf64_Ehdr);
     for (unsigned i = 0; i < header.e_phnum; ++i) {
         Phdr ph;
-        std::memcpy(&ph, bytes.data() + header.e_phoff + uint64_t{i} * header.e_phentsize,
-                    sizeof ph);
+        std::memcpy(&ph, bytes.data() + tableOffset + uint64_t{i} * header.e_phentsize, sizeof ph);
+        // A segment reaching past the address space belongs to no process.
+        if (saturatingAdd(ph.p_vaddr, ph.p_memsz) > kAddressLimit) {
+            continue;
+        }
         if (ph.p_type == PT_LOAD) {
             info.loads.push_back(ElfLoadSegment{ph.p_offset, ph.p_vaddr, ph.p_memsz, ph.p_flags});
         } else if (ph.p_type == PT_GNU_RELRO) {
@@ -62,11 +78,13 @@ uint64_t alignDown(uint64_t value, uint64_t pageSize) {
     return value & ~(pageSize - 1);
 }
 
-std::shared_ptr<const ElfProgramInfo> readProgramInfo(ElfCache::Reader read, void *context) {
+// The program headers of a file; null for a file that is not ELF, nullopt
+// when it could not be read (which says nothing about the file).
+std::optional<std::shared_ptr<const ElfProgramInfo>> readProgramInfo(ElfCache::Reader read, void *context) {
     std::string bytes(kFirstRead, '\0');
     int64_t n = read(context, 0, bytes.data(), bytes.size());
-    if (n <= 0) {
-        return nullptr;
+    if (n < 0) {
+        return std::nullopt;
     }
     bytes.resize(static_cast<size_t>(n));
     uint64_t needed = 0;
@@ -75,14 +93,14 @@ std::shared_ptr<const ElfProgramInfo> readProgramInfo(ElfCache::Reader read, voi
         static_cast<size_t>(n) == kFirstRead) {
         bytes.assign(needed, '\0');
         n = read(context, 0, bytes.data(), bytes.size());
-        if (n <= 0) {
-            return nullptr;
+        if (n < 0) {
+            return std::nullopt;
         }
         bytes.resize(static_cast<size_t>(n));
         info = parseElfProgramHeaders(bytes, needed);
     }
     if (!info) {
-        return nullptr;
+        return std::shared_ptr<const ElfProgramInfo>();
     }
     return std::make_shared<const ElfProgramInfo>(std::move(*info));
 }
@@ -120,6 +138,11 @@ std::vector<ImageSegment> imageSegments(const ElfProgramInfo &info, uint64_t bia
         }
         const uint64_t start = load.vaddr;
         const uint64_t end = load.vaddr + load.memsz;
+        // The bias comes from where the process mapped the file; segments
+        // a crafted header places beyond the address space are left out.
+        if (saturatingAdd(bias, end) > kAddressLimit) {
+            continue;
+        }
         if ((load.flags & PF_W) == 0) {
             segments.push_back(ImageSegment{bias + start, load.memsz, "__TEXT"});
             continue;
@@ -165,8 +188,13 @@ std::shared_ptr<const ElfProgramInfo> ElfCache::lookup(uint64_t device, uint64_t
     // Read outside the lock: two threads may both read a file the first
     // time, which is cheaper than serialising every first read.
     auto info = readProgramInfo(read, context);
+    if (!info) {
+        // A read that failed (the process went away while it was read, a
+        // file that could not be reached) is asked again next time.
+        return nullptr;
+    }
     std::lock_guard<std::mutex> lock(_mutex);
-    auto [it, inserted] = _entries.try_emplace(key, std::move(info));
+    auto [it, inserted] = _entries.try_emplace(key, std::move(*info));
     return it->second;
 }
 
@@ -198,11 +226,22 @@ std::vector<ProcessImage> processImages(const std::vector<SmapsRegion> &regions,
     // later mappings of an image (its relro and data pages) fall inside it
     // and need no bias of their own.
     std::map<std::pair<uint64_t, uint64_t>, std::vector<std::pair<uint64_t, uint64_t>>> spans;
+    // Only a file the process maps executable somewhere can be an image:
+    // no other file is ever read.
+    std::set<std::pair<uint64_t, uint64_t>> executableFiles;
+    for (const SmapsRegion &region : regions) {
+        if (region.exec && region.inode != 0) {
+            executableFiles.emplace((uint64_t{region.devMajor} << 32) | region.devMinor, region.inode);
+        }
+    }
     for (const SmapsRegion &region : regions) {
         if (region.inode == 0 || region.path.empty() || region.path[0] != '/') {
             continue;
         }
         const uint64_t device = (uint64_t{region.devMajor} << 32) | region.devMinor;
+        if (executableFiles.count({device, region.inode}) == 0) {
+            continue;
+        }
         auto &fileSpans = spans[{device, region.inode}];
         const bool covered =
             std::any_of(fileSpans.begin(), fileSpans.end(), [&](const auto &span) {

@@ -71,14 +71,16 @@ std::optional<uint64_t> loadBias(const ElfProgramInfo &info, uint64_t start, uin
                                  uint64_t pageSize);
 
 // Run-wide, thread-safe cache of program headers by (device, inode). A file
-// that is not ELF is remembered as such.
+// that is not ELF is remembered as such; a file that could not be read is
+// not remembered at all, so a process that exits while its file is read
+// costs no other process its image.
 class ElfCache {
 public:
     using Reader = int64_t (*)(void *context, uint64_t offset, void *out, size_t size);
 
     // Looks the file up, reading it through `read` (bytes at an offset of
-    // the file, or -errno) on first sight. Returns null for files that are
-    // not ELF or cannot be read.
+    // the file, or -errno; a short count is the end of the file) on first
+    // sight. Returns null for files that are not ELF or cannot be read.
     std::shared_ptr<const ElfProgramInfo> lookup(uint64_t device, uint64_t inode, Reader read,
                                                  void *context);
 
@@ -100,9 +102,9 @@ private:
     std::unordered_map<Key, std::shared_ptr<const ElfProgramInfo>, KeyHash> _entries;
 };
 
-// The images of a process from its parsed mappings. `read` opens a mapped
-// file of the process: it is given the mapping and must read bytes of its
-// file (through /proc/PID/map_files/ or /proc/PID/root/PATH).
+// The images of a process from its parsed mappings: the ELF files it maps
+// executable somewhere (no other file is read). `read` is given one mapping
+// of such a file and must read bytes of the file at a file offset.
 using MappedFileReader = int64_t (*)(void *context, const SmapsRegion &region, uint64_t offset,
                                      void *out, size_t size);
 

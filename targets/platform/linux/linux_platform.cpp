@@ -137,41 +137,128 @@ std::vector<uint64_t> threadStackPointers(int dirFd) {
     return pointers;
 }
 
-struct MappedFileContext {
-    int dirFd;
-};
-
-// True when `name` under `dirFd` is the regular file with the mapping's
-// inode. Device mappings are never opened: opening a device can act.
-bool isMappedRegularFile(int dirFd, const char *name, const SmapsRegion &region) {
-    struct stat st {};
-    return ::fstatat(dirFd, name, &st, 0) == 0 && S_ISREG(st.st_mode) && st.st_ino == region.inode;
+uint64_t deviceNumber(uint32_t majorNumber, uint32_t minorNumber) {
+    return (uint64_t{majorNumber} << 32) | minorNumber;
 }
 
-// Reads a file the process maps: through map_files/ (which also reaches
-// deleted files) and, when that is refused, through the process's root.
-int64_t readMappedFile(void *context, const SmapsRegion &region, uint64_t offset, void *out,
-                       size_t size) {
-    const int dirFd = static_cast<MappedFileContext *>(context)->dirFd;
-    if (region.hasFlag(vs::kVmIo) || region.hasFlag(vs::kVmPfnMap)) {
-        return -ENODEV;
+// Reads bytes of a file another process maps, opened through `name` under
+// `dirFd`. The open can neither block on a FIFO nor take a terminal, and
+// whatever it reaches must be the regular file (device, inode) the process
+// maps: a path may name another file by now. -errno on failure.
+int64_t readFileOfProcess(int dirFd, const char *name, int flags, uint64_t device, uint64_t inode,
+                          uint64_t offset, void *out, size_t size) {
+    UniqueFd fd(::openat(dirFd, name, O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC | flags));
+    if (!fd.valid()) {
+        return -errno;
     }
-    char name[64];
-    std::snprintf(name, sizeof name, "map_files/%llx-%llx",
-                  static_cast<unsigned long long>(region.start),
-                  static_cast<unsigned long long>(region.end));
-    if (isMappedRegularFile(dirFd, name, region)) {
-        const int64_t n = vs::readBytesAt(dirFd, name, offset, out, size);
-        if (n >= 0) {
-            return n;
-        }
+    struct stat st {};
+    if (::fstat(fd.get(), &st) != 0) {
+        return -errno;
     }
-    // The path may name another file by now; only the mapped inode counts.
-    const std::string rooted = "root" + region.path;
-    if (!isMappedRegularFile(dirFd, rooted.c_str(), region)) {
+    if (!S_ISREG(st.st_mode) || st.st_ino != inode || deviceNumber(major(st.st_dev), minor(st.st_dev)) != device) {
         return -ENOENT;
     }
-    return vs::readBytesAt(dirFd, rooted.c_str(), offset, out, size);
+    size_t done = 0;
+    while (done < size) {
+        const ssize_t n = ::pread(fd.get(), static_cast<char *>(out) + done, size - done,
+                                  static_cast<off_t>(offset + done));
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n < 0) {
+            return -errno;
+        }
+        if (n == 0) {
+            break;
+        }
+        done += static_cast<size_t>(n);
+    }
+    return static_cast<int64_t>(done);
+}
+
+// What a header probe of one process may use.
+struct MappedFileContext {
+    int dirFd;
+    const std::vector<SmapsRegion> &regions;
+    uint64_t pageSize;
+    // Whether files on a device may be opened for a probe (a local file
+    // system); devices missing here are not opened.
+    const std::unordered_map<uint64_t, bool> &openableDevices;
+    bool memoryOpened = false;
+    UniqueFd pagemap;
+    UniqueFd mem;
+};
+
+// Reads file bytes out of the process's own mapping of the file, but only
+// from pages it has present: nothing is faulted in, no file is opened, so
+// the read can neither start I/O nor wait for a file system. -ENODATA when
+// the process does not hold all the pages asked for.
+int64_t readFileFromMemory(MappedFileContext &c, const SmapsRegion &file, uint64_t offset, void *out,
+                           size_t size) {
+    constexpr uint64_t kPresent = 1ull << 63;
+    for (const SmapsRegion &mapping : c.regions) {
+        if (mapping.inode != file.inode || mapping.devMajor != file.devMajor ||
+            mapping.devMinor != file.devMinor || offset < mapping.offset ||
+            offset - mapping.offset >= mapping.size() || size > mapping.size() - (offset - mapping.offset)) {
+            continue;
+        }
+        if (!c.memoryOpened) {
+            c.memoryOpened = true;
+            c.pagemap = UniqueFd(::openat(c.dirFd, "pagemap", O_RDONLY | O_CLOEXEC));
+            c.mem = UniqueFd(::openat(c.dirFd, "mem", O_RDONLY | O_CLOEXEC));
+        }
+        if (!c.pagemap.valid() || !c.mem.valid()) {
+            return -ENODATA;
+        }
+        const uint64_t address = mapping.start + (offset - mapping.offset);
+        const uint64_t first = address / c.pageSize;
+        const uint64_t last = (address + size + c.pageSize - 1) / c.pageSize;
+        std::vector<uint64_t> entries(last - first);
+        const ssize_t n = ::pread(c.pagemap.get(), entries.data(), entries.size() * sizeof(uint64_t),
+                                  static_cast<off_t>(first * sizeof(uint64_t)));
+        if (n != static_cast<ssize_t>(entries.size() * sizeof(uint64_t))) {
+            return n < 0 ? -errno : -ENODATA;
+        }
+        for (uint64_t entry : entries) {
+            if ((entry & kPresent) == 0) {
+                return -ENODATA;
+            }
+        }
+        const ssize_t got = ::pread(c.mem.get(), out, size, static_cast<off_t>(address));
+        return got < 0 ? -errno : got;
+    }
+    return -ENODATA;
+}
+
+// Reads a file the process maps: from the process's memory where its pages
+// are present, else by opening the mapped file itself through map_files/
+// (which also reaches deleted files) or, when that is refused, through the
+// process's root. Files on file systems that may not answer are not opened.
+int64_t readMappedFile(void *context, const SmapsRegion &region, uint64_t offset, void *out, size_t size) {
+    auto &c = *static_cast<MappedFileContext *>(context);
+    if (region.hasFlag(vs::kVmIo) || region.hasFlag(vs::kVmPfnMap)) {
+        return -ENODEV; // a device: opening one can act
+    }
+    const int64_t fromMemory = readFileFromMemory(c, region, offset, out, size);
+    if (fromMemory != -ENODATA) {
+        return fromMemory;
+    }
+    const uint64_t device = deviceNumber(region.devMajor, region.devMinor);
+    const auto openable = c.openableDevices.find(device);
+    if (openable == c.openableDevices.end() || !openable->second) {
+        return -EAGAIN; // not worth remembering: another process may hold the pages
+    }
+    char name[64];
+    std::snprintf(name, sizeof name, "map_files/%llx-%llx", static_cast<unsigned long long>(region.start),
+                  static_cast<unsigned long long>(region.end));
+    // map_files entries are links by nature: they cannot be opened without
+    // following, and lead to exactly the mapped file.
+    const int64_t n = readFileOfProcess(c.dirFd, name, 0, device, region.inode, offset, out, size);
+    if (n >= 0 || n == -ESRCH) {
+        return n;
+    }
+    const std::string rooted = "root" + region.path;
+    return readFileOfProcess(c.dirFd, rooted.c_str(), O_NOFOLLOW, device, region.inode, offset, out, size);
 }
 
 // Index of the first region ending above `address`, or regions.size().
@@ -334,14 +421,24 @@ int32_t VSLinuxPlatform::pid_bsd_info(int32_t pid, VSBsdInfo &info) {
     // few programs: their headers are read once per file, through the first
     // process met that runs it.
     bool is64 = hostIs64Bit();
-    struct stat exe {};
-    if (::fstatat(dirFd, "exe", &exe, 0) == 0 && S_ISREG(exe.st_mode)) {
-        const uint64_t device = (uint64_t{major(exe.st_dev)} << 32) | minor(exe.st_dev);
-        auto readExe = [](void *context, uint64_t offset, void *out, size_t size) {
-            return vs::readBytesAt(*static_cast<int *>(context), "exe", offset, out, size);
-        };
-        if (auto program = vs::ElfCache::shared().lookup(device, exe.st_ino, readExe, &dirFd)) {
-            is64 = program->is64bit;
+    // Asked without syncing, so that a FUSE or network file system is not
+    // asked about the file; its device tells whether it may be opened.
+    struct statx exe {};
+    if (::statx(dirFd, "exe", AT_STATX_DONT_SYNC, STATX_TYPE | STATX_INO, &exe) == 0 && S_ISREG(exe.stx_mode)) {
+        const uint64_t device = deviceNumber(exe.stx_dev_major, exe.stx_dev_minor);
+        const auto openable = _openableDevices().find(device);
+        if (openable != _openableDevices().end() && openable->second) {
+            struct ExeContext {
+                int dirFd;
+                uint64_t device, inode;
+            } context{dirFd, device, exe.stx_ino};
+            auto readExe = [](void *context, uint64_t offset, void *out, size_t size) {
+                const auto &c = *static_cast<const ExeContext *>(context);
+                return readFileOfProcess(c.dirFd, "exe", 0, c.device, c.inode, offset, out, size);
+            };
+            if (auto program = vs::ElfCache::shared().lookup(device, exe.stx_ino, readExe, &context)) {
+                is64 = program->is64bit;
+            }
         }
     }
     if (is64) {
@@ -641,14 +738,29 @@ VSReturnCode VSLinuxPlatform::release_task_handle(VSTaskHandle task) {
     return 0;
 }
 
-const std::vector<uint64_t> &VSLinuxPlatform::_tmpfsDevices() {
-    std::call_once(_tmpfsOnce, [this] {
+void VSLinuxPlatform::_readMounts() {
+    std::call_once(_mountsOnce, [this] {
         std::string_view mountinfo;
-        if (vs::readFileAt(AT_FDCWD, "/proc/self/mountinfo", mountinfo) == 0) {
-            _tmpfs = vs::parseTmpfsDevices(mountinfo);
+        if (vs::readFileAt(AT_FDCWD, "/proc/self/mountinfo", mountinfo) != 0) {
+            return;
+        }
+        for (const vs::MountDevice &mount : vs::parseMountDevices(mountinfo)) {
+            if (mount.type == "tmpfs") {
+                _tmpfs.push_back(mount.device);
+            }
+            _openable[mount.device] = vs::mayProbeFileSystem(mount.type);
         }
     });
+}
+
+const std::vector<uint64_t> &VSLinuxPlatform::_tmpfsDevices() {
+    _readMounts();
     return _tmpfs;
+}
+
+const std::unordered_map<uint64_t, bool> &VSLinuxPlatform::_openableDevices() {
+    _readMounts();
+    return _openable;
 }
 
 VSReturnCode VSLinuxPlatform::_parse(Task &task) {
@@ -947,7 +1059,7 @@ std::vector<VSSymbolicatorImage> VSLinuxPlatform::symbolicator(VSTaskHandle hand
     if (_ensureParsed(*task) != 0) {
         return result;
     }
-    MappedFileContext context{task->dir.get()};
+    MappedFileContext context{task->dir.get(), task->regions, _pageSize, _openableDevices(), false, {}, {}};
     const auto images = vs::processImages(task->regions, _pageSize, vs::ElfCache::shared(),
                                           readMappedFile, &context);
     result.reserve(images.size());

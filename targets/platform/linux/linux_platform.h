@@ -107,7 +107,11 @@ private:
     VSReturnCode _parse(Task &task);
     // Forgets the parse; the next region query parses again.
     void _releaseParse(Task &task);
+    // The mount table, read once: tmpfs devices, and which devices hold
+    // file systems whose files may be opened for a header probe.
+    void _readMounts();
     const std::vector<uint64_t> &_tmpfsDevices();
+    const std::unordered_map<uint64_t, bool> &_openableDevices();
 
     uint64_t _pageSize;
     std::mutex _tasksMutex;
@@ -129,8 +133,9 @@ private:
     std::mutex _missingSettingsMutex;
     std::unordered_set<std::string> _missingSettings;
 
-    std::once_flag _tmpfsOnce;
+    std::once_flag _mountsOnce;
     std::vector<uint64_t> _tmpfs;
+    std::unordered_map<uint64_t, bool> _openable;
 
     std::once_flag _kpageflagsOnce;
     int _kpageflagsFd = -1;

@@ -166,9 +166,9 @@ std::optional<uint64_t> parseSyscallStackPointer(std::string_view text) {
     return value;
 }
 
-std::vector<uint64_t> parseTmpfsDevices(std::string_view mountinfo) {
+std::vector<MountDevice> parseMountDevices(std::string_view mountinfo) {
     // 36 35 0:22 / /dev/shm rw,nosuid shared:3 - tmpfs tmpfs rw
-    std::vector<uint64_t> devices;
+    std::vector<MountDevice> devices;
     size_t pos = 0;
     while (pos < mountinfo.size()) {
         size_t newline = mountinfo.find('\n', pos);
@@ -181,26 +181,42 @@ std::vector<uint64_t> parseTmpfsDevices(std::string_view mountinfo) {
         if (separator == std::string_view::npos) {
             continue;
         }
-        const std::string_view rest = line.substr(separator + 3);
-        if (rest.compare(0, 6, "tmpfs ") != 0) {
-            continue;
-        }
+        std::string_view type = line.substr(separator + 3);
+        type = type.substr(0, type.find(' '));
         size_t p = 0;
         skipField(line, p); // mount id
         skipField(line, p); // parent id
         skipBlanks(line, p);
         uint64_t major = 0;
         uint64_t minor = 0;
-        if (!readDecimal(line, p, major) || p >= line.size() || line[p] != ':') {
+        if (type.empty() || !readDecimal(line, p, major) || p >= line.size() || line[p] != ':') {
             continue;
         }
         ++p;
         if (!readDecimal(line, p, minor)) {
             continue;
         }
-        devices.push_back((major << 32) | minor);
+        devices.push_back(MountDevice{(major << 32) | minor, std::string(type)});
     }
     return devices;
+}
+
+bool mayProbeFileSystem(std::string_view type) {
+    // FUSE servers and network file systems can take any time to answer,
+    // or never answer: files on them are never opened for a probe.
+    if (type == "fuse" || type == "fuseblk" || type.substr(0, 5) == "fuse." || type == "virtiofs") {
+        return false;
+    }
+    static constexpr std::string_view kNetwork[] = {
+        "nfs", "nfs4", "cifs", "smb3", "smbfs", "9p", "ceph", "afs", "glusterfs", "lustre",
+        "ocfs2", "gfs2", "coda", "ncpfs", "orangefs", "pvfs2", "beegfs", "gpfs", "davfs",
+    };
+    for (std::string_view network : kNetwork) {
+        if (type == network) {
+            return false;
+        }
+    }
+    return true;
 }
 
 uint32_t countArguments(std::string_view cmdline) {

@@ -41,9 +41,18 @@ std::optional<uint64_t> statusBytes(std::string_view status, std::string_view na
 // and for text that does not look like the file.
 std::optional<uint64_t> parseSyscallStackPointer(std::string_view text);
 
-// Device numbers (major << 32 | minor) of the tmpfs mounts listed in a
-// mountinfo text.
-std::vector<uint64_t> parseTmpfsDevices(std::string_view mountinfo);
+// A mounted file system: its device number (major << 32 | minor) and type.
+struct MountDevice {
+    uint64_t device = 0;
+    std::string type;
+};
+
+// Every mount listed in a mountinfo text.
+std::vector<MountDevice> parseMountDevices(std::string_view mountinfo);
+
+// False for file systems whose files a probe must not open because they
+// may not answer: FUSE and network file systems.
+bool mayProbeFileSystem(std::string_view type);
 
 // Number of NUL-terminated strings in a cmdline text; a missing final NUL
 // (a process that rewrote its arguments) still counts the last string.
