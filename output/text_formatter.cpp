@@ -10,6 +10,7 @@
 #include "model/assert.h"
 #include "model/aux_data.h"
 #include "model/memory_region.h"
+#include "output/visible_text.h"
 #include "targets/process.h"
 
 namespace {
@@ -24,6 +25,16 @@ void padLeft(std::string &line, int width, const char *text) {
         line.append(static_cast<std::size_t>(width) - length, ' ');
     }
     line.append(text, length);
+}
+
+// `text` as the terminal should see it (names come from other users);
+// `scratch` holds an escaped copy while the result is in use.
+const char *shown(const std::string &text, std::string &scratch) {
+    if (vs::isVisibleText(text)) {
+        return text.c_str();
+    }
+    scratch = vs::visibleText(text);
+    return scratch.c_str();
 }
 
 std::uint64_t pagesOf(std::uint64_t bytes, std::uint64_t pageSize) {
@@ -141,9 +152,10 @@ void VSOutputFormatterText::_printCategories(const VSCategoryTable &categories,
         auto found = categories.find(key);
         VS_ASSERT(found != categories.end());
         const VSMemoryCategory &category = found->second;
+        std::string scratch;
         _printRow(category.totalDirtySize() + category.totalSwappedSize(), category.totalSwappedSize(),
                   category.totalCleanSize(), category.totalReclaimableSize(), category.totalWiredSize(),
-                  category.totalRegions(), key.c_str());
+                  category.totalRegions(), shown(key, scratch));
     }
 }
 
@@ -165,19 +177,20 @@ void VSOutputFormatterText::printProcessHeader(const VSProcess &process) {
     ++_processCount;
     _pageSize = process.pageSize();
     _printRule(false);
-    std::fprintf(_output, "%s: %s-bit", process.displayString().c_str(), process.is64bit() ? "64" : "32");
+    std::string scratch;
+    std::fprintf(_output, "%s: %s-bit", shown(process.displayString(), scratch), process.is64bit() ? "64" : "32");
     const auto &warnings = process.warnings();
     if (!warnings.empty()) {
         std::fputs("\nWarnings were encountered while examining the process.\n", _output);
         for (const std::string &warning : warnings) {
-            std::fprintf(_output, "\t%s\n", warning.c_str());
+            std::fprintf(_output, "\t%s\n", shown(warning, scratch));
         }
     }
     const auto errors = process.errors();
     if (!errors.empty()) {
         std::fputs("\nErrors were encountered while examining the process. No results gathered.\n", _output);
         for (const std::string &error : errors) {
-            std::fprintf(_output, "\t%s\n", error.c_str());
+            std::fprintf(_output, "\t%s\n", shown(error, scratch));
         }
     }
 }
@@ -211,7 +224,8 @@ void VSOutputFormatterText::printSharedCategories(const VSCategoryTable &categor
             if (other->pid() == process.pid()) {
                 continue;
             }
-            std::fprintf(_output, " %s", other->displayString().c_str());
+            std::string scratch;
+            std::fprintf(_output, " %s", shown(other->displayString(), scratch));
             ++printed;
             if (members - 1 > printed) {
                 std::fputs(",", _output);
@@ -237,19 +251,22 @@ void VSOutputFormatterText::printProcessesWithWarnings(const std::vector<const V
     if (!processesWithWarnings.empty()) {
         std::fputs("\nWarnings were encountered while examining the following processes:\n", _output);
         for (const VSProcess *process : processesWithWarnings) {
-            std::fprintf(_output, "\t%s\n", process->name().c_str());
+            std::string scratch;
+            std::fprintf(_output, "\t%s\n", shown(process->name(), scratch));
         }
     }
     if (!processesWithErrors.empty()) {
         std::fputs("\nErrors were encountered while examining the following processes:\n", _output);
         for (const VSProcess *process : processesWithErrors) {
-            std::fprintf(_output, "\t%s\n", process->name().c_str());
+            std::string scratch;
+            std::fprintf(_output, "\t%s\n", shown(process->name(), scratch));
         }
     }
     if (!globalErrors.empty()) {
         std::fputs("\nErrors were encountered:\n", _output);
         for (const std::string &error : globalErrors) {
-            std::fprintf(_output, "\t%s\n", error.c_str());
+            std::string scratch;
+            std::fprintf(_output, "\t%s\n", shown(error, scratch));
         }
     }
     if (!processesWithErrors.empty() || !globalErrors.empty()) {
@@ -319,7 +336,8 @@ void VSOutputFormatterText::printSpanlistLikeOutputForProcess(const VSProcess &p
     const std::uint64_t pageSize = process.pageSize();
     const bool swapped = _showsSwapped();
     const bool wired = _showsWired();
-    std::fprintf(_output, "%s\n\n", process.displayString().c_str());
+    std::string scratch;
+    std::fprintf(_output, "%s\n\n", shown(process.displayString(), scratch));
     std::fprintf(_output,
                  "           start                end  [objectid]      VRT     DRT%*s     CLN     RCL%*s   tag "
                  "(detail)\n",
@@ -345,9 +363,11 @@ void VSOutputFormatterText::printSpanlistLikeOutputForProcess(const VSProcess &p
         if (wired) {
             std::fprintf(_output, " %7llu", static_cast<unsigned long long>(pagesOf(region->wiredSize(), pageSize)));
         }
-        const std::optional<std::string> name = region->name();
-        const std::optional<std::string> detailedName = region->detailedName();
-        std::fprintf(_output, "   %s %s\n", name ? name->c_str() : "", detailedName ? detailedName->c_str() : "");
+        const std::string *name = region->sharedName();
+        const std::string *detailedName = region->sharedDetailedName();
+        std::string detailScratch;
+        std::fprintf(_output, "   %s %s\n", name ? shown(*name, scratch) : "",
+                     detailedName ? shown(*detailedName, detailScratch) : "");
     }
     std::fputs("\n", _output);
 }

@@ -1,5 +1,6 @@
 // The text report byte for byte: whole driver runs over prepared targets.
 
+#include "output/visible_text.h"
 #include "tests/report/report_support.h"
 
 using namespace report_test;
@@ -87,4 +88,49 @@ TEST(TextReport, RegionListingWithBothOptionalColumns) {
               "       16b000000 -        16b080000 [      7f01]      32       4       0       1       0       1   "
               "stack \n"
               "\n");
+}
+
+// Names come from other users: nothing in them may act on the terminal or forge a report line. Printable UTF-8
+// passes; control bytes, C1 controls, bytes that are not UTF-8 and the escape character itself are escaped.
+TEST(TextReport, NamesFromOtherUsersCannotActOnTheTerminal) {
+    const std::pair<std::string, std::string> cases[] = {
+        {"café ☕ /usr/lib/x86_64-linux-gnu/libc.so.6", "café ☕ /usr/lib/x86_64-linux-gnu/libc.so.6"},
+        {"\x1b]0;owned\x07tab\there", "\\x1b]0;owned\\x07tab\\there"},
+        {"two\nlines\r", "two\\nlines\\r"},
+        {"C1 \xc2\x9b" "2J, DEL \x7f", "C1 \\xc2\\x9b2J, DEL \\x7f"},
+        {"not UTF-8 \xff, overlong \xc0\xaf, surrogate \xed\xa0\x80, cut \xe2\x98", "not UTF-8 \\xff, overlong "
+                                                                                   "\\xc0\\xaf, surrogate \\xed\\xa0"
+                                                                                   "\\x80, cut \\xe2\\x98"},
+        {"back\\slash", "back\\\\slash"},
+    };
+    for (const auto &[name, shown] : cases) {
+        EXPECT_EQ(vs::visibleText(name), shown);
+        EXPECT_EQ(vs::isVisibleText(name), name == shown) << shown;
+    }
+
+    const std::string evil = "evil\x1b[2J\nVestage: 0 B";
+    ReportRun run;
+    run.process(9, evil).region({.name = "mapped file /tmp/\x1b]0;pwned\x07", .objectId = 1, .dirty = 16 * KiB});
+    run.process(8, "victim").region({.name = "mapped file /tmp/\x1b]0;pwned\x07", .objectId = 1, .dirty = 16 * KiB});
+    run.process(7, "other").error(evil + " [9]: gone\n");
+    run.gather();
+    std::vector<const VSMemoryRegion *> regions;
+    for (const auto &region : run.vestage->processes()[0]->memoryRegions()) {
+        regions.push_back(region.get());
+    }
+    VSOutputFormatterText listing(VSSummaryFormatFormatted, 0);
+    testing::internal::CaptureStdout();
+    listing.printSpanlistLikeOutputForProcess(*run.vestage->processes()[0], regions);
+    std::string text = testing::internal::GetCapturedStdout();
+    text += run.report();
+    EXPECT_EQ(text.find('\x1b'), std::string::npos) << text;
+    EXPECT_EQ(text.find("\nVestage: 0 B"), std::string::npos) << text;
+    for (const char *line : {"evil\\x1b[2J\\nVestage: 0 B [9]\n",                   // -v listing
+                             "evil\\x1b[2J\\nVestage: 0 B [9]: 64-bit\tVestage",    // process header
+                             "Shared with evil\\x1b[2J\\nVestage: 0 B [9]:\n",       // the victim's shared table
+                             "mapped file /tmp/\\x1b]0;pwned\\x07\n",               // category
+                             "\tevil\\x1b[2J\\nVestage: 0 B [9]: gone\\n\n",         // an error naming it
+                             "processes:\n\tother\n"}) {
+        EXPECT_NE(text.find(line), std::string::npos) << line << "\n" << text;
+    }
 }
