@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstring>
 #include <initializer_list>
+#include <mutex>
 #include <unordered_set>
 
 #include "analysis/work_queue.h"
@@ -15,6 +16,9 @@ namespace {
 
 constexpr const char *kGatherQueueLabel = "org.vestage.gatherdata";
 constexpr const char *kBreakDownSetting = "vm.self_region_vestage";
+constexpr const char *kSharingUnresolvedNote =
+    "Pages shared after fork could not be told apart without the right to read page frames (run as root): "
+    "each process counts them as its own";
 constexpr const char *kEarlyExitError = "Vestage exited early due to SIGINT and did not finish gathering all data";
 constexpr std::uint64_t kFoldLimit = 1048576;
 
@@ -64,11 +68,33 @@ void VSVestage::addOutputFormatter(std::unique_ptr<VSOutputFormatter> formatter)
 void VSVestage::gatherData() {
     vs::WorkQueue queue(kGatherQueueLabel, _gatherWidth);
     const std::vector<VSProcess *> order = _getProcessListSortedByPidDesc();
+    // Targets that share pages with others are walked only once every
+    // target has been looked at; the rest gather at once.
+    std::mutex waitingMutex;
+    std::vector<VSProcess *> waiting;
     queue.parallel_for(order.size(), [&](std::size_t index) {
-        if (!_earlyExit.load()) {
+        if (_earlyExit.load()) {
+            return;
+        }
+        if (order[index]->prepareGatherData()) {
+            std::lock_guard<std::mutex> lock(waitingMutex);
+            waiting.push_back(order[index]);
+        } else {
             order[index]->gatherData();
         }
     });
+    if (!waiting.empty()) {
+        if (!VSPlatform::current().resolve_shared_pages()) {
+            VSProcess::_addGlobalNote(kSharingUnresolvedNote);
+        }
+        // Keep the walks in pid order, as the other targets were.
+        std::sort(waiting.begin(), waiting.end(), [](const VSProcess *a, const VSProcess *b) { return a->pid() > b->pid(); });
+        queue.parallel_for(waiting.size(), [&](std::size_t index) {
+            if (!_earlyExit.load()) {
+                waiting[index]->gatherData();
+            }
+        });
+    }
     if (_earlyExit.load()) {
         VSProcess::_addGlobalError(kEarlyExitError);
     }
@@ -583,8 +609,10 @@ void VSVestage::printOutputVerbose(bool verbose, bool summarize) {
     }
 
     const std::vector<std::string> globalErrors = VSProcess::globalErrors();
+    const std::vector<std::string> globalNotes = VSProcess::globalNotes();
     for (const std::unique_ptr<VSOutputFormatter> &formatter : _outputFormatters) {
         formatter->printProcessesWithWarnings(processesWithWarnings, processesWithErrors, globalErrors);
+        formatter->printNotes(globalNotes);
     }
 
     const VSCategoryTable summary = _summarizedCategoriesForCategories(_categoriesForAllProcesses(), summarize, totals);

@@ -165,6 +165,7 @@ inline constexpr std::uint32_t kTagMemfd = 43;              // "memfd"
 inline constexpr std::uint32_t kTagSysVSharedMemory = 44;   // "SysV shared memory"
 inline constexpr std::uint32_t kTagPosixSharedMemory = 45;  // "POSIX shared memory"
 inline constexpr std::uint32_t kTagDevZero = 46;            // "/dev/zero mapping"
+inline constexpr std::uint32_t kTagHugetlb = 83;            // "hugetlbfs"
 inline constexpr std::uint32_t kTagUprobes = 86;            // "uprobes"
 
 // Tags 240 to 255 are numbered "app-specific tag 1" to "16".

@@ -147,6 +147,12 @@ void VSOutputFormatterJSON::printProcessesWithWarnings(const std::vector<const V
     _data["warnings"] = std::move(warnings);
 }
 
+void VSOutputFormatterJSON::printNotes(const std::vector<std::string> &notes) {
+    if (!notes.empty()) {
+        _data["notes"] = notes;
+    }
+}
+
 void VSOutputFormatterJSON::printSummaryCategories(const VSCategoryTable &categories, const VSSortedCategoryKeys &,
                                                    const VSCategoryTotals &total, bool) {
     nlohmann::json summary = JSONForCategories(categories);

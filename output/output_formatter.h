@@ -48,6 +48,9 @@ public:
     virtual void printProcessesWithWarnings(const std::vector<const VSProcess *> &processesWithWarnings,
                                             const std::vector<const VSProcess *> &processesWithErrors,
                                             const std::vector<std::string> &globalErrors) = 0;
+    // How the figures were obtained, where the reader should know (never
+    // errors). Called once, possibly with no notes.
+    virtual void printNotes(const std::vector<std::string> &) {}
     // The table over all targets.
     virtual void printSummaryCategories(const VSCategoryTable &categories,
                                         const VSSortedCategoryKeys &sortedKeys,

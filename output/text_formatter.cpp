@@ -274,6 +274,17 @@ void VSOutputFormatterText::printProcessesWithWarnings(const std::vector<const V
     }
 }
 
+void VSOutputFormatterText::printNotes(const std::vector<std::string> &notes) {
+    if (notes.empty()) {
+        return;
+    }
+    std::fputs("\nNotes:\n", _output);
+    for (const std::string &note : notes) {
+        std::string scratch;
+        std::fprintf(_output, "\t%s\n", shown(note, scratch));
+    }
+}
+
 void VSOutputFormatterText::_printPhysVestageBreakdownEnabled() {
     // Standard output itself, not `output`.
     if (VSVestage::breakDownPhysVestage()) {

@@ -42,6 +42,7 @@ public:
     void printProcessCategories(const VSCategoryTable &categories, const VSSortedCategoryKeys &sortedKeys,
                                 const VSCategoryTotals &total) override;
     void printProcessAuxData(const VSAuxDataDictionary *auxData) override;
+    void printNotes(const std::vector<std::string> &notes) override;
     void printProcessesWithWarnings(const std::vector<const VSProcess *> &processesWithWarnings,
                                     const std::vector<const VSProcess *> &processesWithErrors,
                                     const std::vector<std::string> &globalErrors) override;

@@ -1,5 +1,6 @@
 #include "targets/process.h"
 
+#include <algorithm>
 #include <atomic>
 #include <cctype>
 #include <cerrno>
@@ -21,6 +22,7 @@ namespace {
 // The run-wide global error list, created on first use.
 std::once_flag globalErrorsOnce;
 std::optional<std::vector<std::string>> globalErrorList;
+std::vector<std::string> globalNoteList;
 
 // Text of a fixed-width, zero-padded field that need not be terminated.
 std::string fixedField(const char *field, size_t width) {
@@ -167,6 +169,8 @@ bool VSProcess::_populateTask() { return false; }
 
 void VSProcess::gatherData() {}
 
+bool VSProcess::prepareGatherData() { return false; }
+
 std::shared_ptr<const VSAuxDataDictionary> VSProcess::auxData() const {
     return std::make_shared<const VSAuxDataDictionary>();
 }
@@ -191,7 +195,16 @@ void VSProcess::_clearGlobalErrors() {
     if (globalErrorList) {
         globalErrorList->clear();
     }
+    globalNoteList.clear();
 }
+
+void VSProcess::_addGlobalNote(std::string note) {
+    if (std::find(globalNoteList.begin(), globalNoteList.end(), note) == globalNoteList.end()) {
+        globalNoteList.push_back(std::move(note));
+    }
+}
+
+std::vector<std::string> VSProcess::globalNotes() { return globalNoteList; }
 
 std::vector<std::string> VSProcess::globalErrors() {
     if (!globalErrorList) {

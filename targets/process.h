@@ -99,6 +99,10 @@ public:
     static void _clearGlobalErrors();
     // A copy of the list; empty when nothing was ever added.
     static std::vector<std::string> globalErrors();
+    // Notes on how the figures were obtained, tied to no target; unlike
+    // errors they leave the summary valid. Main thread only.
+    static void _addGlobalNote(std::string note);
+    static std::vector<std::string> globalNotes();
 
     // ---- names ---------------------------------------------------------------
     // The record's own name: the 32-byte name field, else the 16-byte
@@ -145,6 +149,10 @@ public:
     // Reads the target's images and regions (sets memoryRegions). Runs once,
     // on a worker thread. The base does nothing.
     virtual void gatherData();
+    // Runs on a worker before any target gathers; true when gatherData must
+    // wait until every target is prepared (the pages it shares with other
+    // targets are known only then). The base needs no preparation.
+    virtual bool prepareGatherData();
     // The target's auxiliary data, or null when it has none. The base
     // returns an empty dictionary.
     virtual std::shared_ptr<const VSAuxDataDictionary> auxData() const;

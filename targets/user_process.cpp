@@ -183,6 +183,10 @@ std::shared_ptr<const VSAuxDataDictionary> VSUserProcess::auxData() const {
 
 // ---- gathering ----------------------------------------------------------------------
 
+bool VSUserProcess::prepareGatherData() {
+    return _isAlive() && _task != vs::kTaskHandleNone && VSPlatform::current().prepare_task_walk(_task);
+}
+
 void VSUserProcess::gatherData() {
     _gatherImageData();
     _gatherMemoryData();
@@ -341,6 +345,7 @@ void VSUserProcess::enumerateRegions(const RegionCallback &callback) {
     // the shared cache range always comes from a query of the current
     // address and never from the iteration before.
     const uint64_t lastBelowSharedCache = _lastNonSharedCacheRegion();
+    std::vector<VSRegionInfo> parts;
 
     while (true) {
         VSRegionInfo info;
@@ -422,6 +427,15 @@ void VSUserProcess::enumerateRegions(const RegionCallback &callback) {
         }
         if (callback(address, size, info, purgeableState, path)) {
             return;
+        }
+        // The other memory objects the same mapping holds pages of, each a
+        // region over the same range.
+        if (platform.region_parts(_task, address, parts) == vs::kReturnSuccess) {
+            for (size_t i = 1; i < parts.size(); ++i) {
+                if (callback(address, size, parts[i], purgeableState, path)) {
+                    return;
+                }
+            }
         }
         if (address + size <= address) {
             return;  // an empty region or one reaching the top: nothing follows

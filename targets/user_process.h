@@ -43,6 +43,7 @@ public:
     // Images, then regions; sets memoryRegions also when the walk stopped
     // early (the regions found so far).
     void gatherData() override;
+    bool prepareGatherData() override;
     // "phys_vestage" and "phys_vestage_peak" when the physical vestage is
     // known, "Kernel memory" {"KPRVT", "KSHRD"} while alive; null when empty.
     std::shared_ptr<const VSAuxDataDictionary> auxData() const override;

@@ -431,6 +431,26 @@ public:
     virtual VSReturnCode region_info(VSTaskHandle task, uint64_t &address, uint64_t &size, int32_t flavor,
                                      VSRegionBasicInfo &info, uint32_t &infoCount, uint32_t &objectName) = 0;
 
+    // Where one mapping holds pages of several memory objects (the page
+    // cache of a private file mapping beside its copies; anonymous pages
+    // shared after fork beside its own), the records of every part of the
+    // region starting at `address`, the first being the one region_recurse
+    // gave. Platforms with one object per region leave `parts` empty.
+    virtual VSReturnCode region_parts(VSTaskHandle, uint64_t, std::vector<VSRegionInfo> &parts) {
+        parts.clear();
+        return 0;
+    }
+
+    // Which pages several targets share is known only once every target's
+    // pages have been looked at. A run first prepares each target's walk
+    // (true: its walk needs the run's resolution; may be called from
+    // several threads), then resolves once, then walks. False from
+    // resolve_shared_pages when sharing could not be resolved (no right to
+    // read page frames); the walk then counts such pages as each target's
+    // own.
+    virtual bool prepare_task_walk(VSTaskHandle) { return false; }
+    virtual bool resolve_shared_pages() { return true; }
+
     // Disposition words (vs::kPageDisposition*) of the pages from `address`
     // rounded down to the page size up to address + length rounded up, at
     // most dispositions.size() of them; `count` comes back as the number

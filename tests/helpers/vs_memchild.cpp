@@ -8,7 +8,11 @@
 //                                pages written
 //   file:LABEL:PATH              PATH mapped read-only and private, every
 //                                page read
-//   shared:LABEL:PAGES           shared anonymous memory, every page written
+//   shared:LABEL:PAGES[:TOUCHED] shared anonymous memory, every page (or the
+//                                first TOUCHED pages) written
+//   pfile:LABEL:PATH:WRITTEN     PATH mapped private and writable, every
+//                                page read, the first WRITTEN pages written
+//   sfile:LABEL:PATH             PATH mapped shared and writable, untouched
 //   shm:LABEL:NAME:PAGES         a POSIX shared memory object /dev/shm/NAME
 //                                mapped shared, every page written
 //   mlock:LABEL:PAGES            anonymous memory written and locked
@@ -28,10 +32,13 @@
 //                                shared items (fork does not copy their page
 //                                tables) and waits like this one; prints its
 //                                pid
+//   fork:LABEL:ITEM:FIRST:COUNT  the same, but the grandchild writes only
+//                                pages FIRST to FIRST+COUNT of item ITEM
 //
 // Every anonymous item is placed between two inaccessible pages so that the
 // kernel cannot merge it with a neighbour of the same protection.
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
@@ -162,6 +169,27 @@ struct SharedItem {
     size_t pages;
 };
 std::vector<SharedItem> gSharedItems;
+// Every item with memory, by label, for the writes of a fork.
+std::vector<std::pair<std::string, SharedItem>> gItems;
+
+void remember(const std::string &label, void *start, size_t pages) {
+    gItems.push_back({label, {static_cast<char *>(start), pages}});
+}
+
+char *mapFile(const std::string &path, int flags, size_t &pages) {
+    const int fd = open(path.c_str(), O_RDWR | O_CLOEXEC);
+    struct stat st {};
+    if (fd < 0 || fstat(fd, &st) != 0) {
+        fail("open " + path);
+    }
+    pages = (static_cast<size_t>(st.st_size) + kPage - 1) / kPage;
+    void *start = mmap(nullptr, pages * kPage, PROT_READ | PROT_WRITE, flags, fd, 0);
+    if (start == MAP_FAILED) {
+        fail("mmap " + path);
+    }
+    close(fd);
+    return static_cast<char *>(start);
+}
 
 void waitForEndOfInput() {
     char buffer[64];
@@ -188,6 +216,23 @@ int main(int argc, char **argv) {
             const size_t pages = number(item[2]);
             char *start = fencedAnonymous(pages, PROT_READ | PROT_WRITE);
             touch(start, number(item[3]));
+            remember(label, start, pages);
+            printRegion(label, start, pages);
+        } else if (kind == "pfile" && item.size() == 4) {
+            size_t pages = 0;
+            char *start = mapFile(item[2], MAP_PRIVATE, pages);
+            unsigned sum = 0;
+            for (size_t p = 0; p < pages; ++p) {
+                sum += static_cast<unsigned char>(static_cast<volatile char *>(start)[p * kPage]);
+            }
+            touch(start, std::min(pages, number(item[3])));
+            remember(label, start, pages);
+            std::printf("%s start=%lx size=%zx sum=%u\n", label.c_str(), reinterpret_cast<unsigned long>(start),
+                        pages * kPage, sum);
+        } else if (kind == "sfile" && item.size() == 3) {
+            size_t pages = 0;
+            char *start = mapFile(item[2], MAP_SHARED, pages);
+            remember(label, start, pages);
             printRegion(label, start, pages);
         } else if (kind == "file" && item.size() == 3) {
             const int fd = open(item[2].c_str(), O_RDONLY | O_CLOEXEC);
@@ -208,15 +253,17 @@ int main(int argc, char **argv) {
             }
             std::printf("%s start=%lx size=%zx sum=%u\n", label.c_str(),
                         reinterpret_cast<unsigned long>(start), pages * kPage, sum);
-        } else if (kind == "shared" && item.size() == 3) {
+        } else if (kind == "shared" && (item.size() == 3 || item.size() == 4)) {
             const size_t pages = number(item[2]);
             void *start = mmap(nullptr, pages * kPage, PROT_READ | PROT_WRITE,
                                MAP_SHARED | MAP_ANONYMOUS, -1, 0);
             if (start == MAP_FAILED) {
                 fail("mmap shared");
             }
-            touch(static_cast<char *>(start), pages);
-            gSharedItems.push_back({static_cast<char *>(start), pages});
+            const size_t touched = item.size() == 4 ? std::min(pages, number(item[3])) : pages;
+            touch(static_cast<char *>(start), touched);
+            gSharedItems.push_back({static_cast<char *>(start), touched});
+            remember(label, start, pages);
             printRegion(label, start, pages);
         } else if (kind == "shm" && item.size() == 4) {
             const size_t pages = number(item[3]);
@@ -232,6 +279,7 @@ int main(int argc, char **argv) {
             close(fd);
             touch(static_cast<char *>(start), pages);
             gSharedItems.push_back({static_cast<char *>(start), pages});
+            remember(label, start, pages);
             printRegion(label, start, pages);
         } else if (kind == "mlock" && item.size() == 3) {
             const size_t pages = number(item[2]);
@@ -286,7 +334,17 @@ int main(int argc, char **argv) {
         } else if (kind == "libc" && item.size() == 2) {
             std::string copy = label;
             dl_iterate_phdr(printLoads, &copy);
-        } else if (kind == "fork" && item.size() == 2) {
+        } else if (kind == "fork" && (item.size() == 2 || item.size() == 5)) {
+            SharedItem written{nullptr, 0};
+            if (item.size() == 5) {
+                const auto found = std::find_if(gItems.begin(), gItems.end(),
+                                                [&](const auto &entry) { return entry.first == item[2]; });
+                if (found == gItems.end() || number(item[3]) + number(item[4]) > found->second.pages) {
+                    std::fprintf(stderr, "vs_memchild: no such pages '%s'\n", argv[i]);
+                    return 2;
+                }
+                written = {found->second.start + number(item[3]) * kPage, number(item[4])};
+            }
             std::fflush(stdout);
             int done[2];
             if (pipe(done) != 0) {
@@ -297,8 +355,12 @@ int main(int argc, char **argv) {
                 fail("fork");
             }
             if (pid == 0) {
-                for (const SharedItem &shared : gSharedItems) {
-                    touch(shared.start, shared.pages);
+                if (written.start != nullptr) {
+                    touch(written.start, written.pages);
+                } else {
+                    for (const SharedItem &shared : gSharedItems) {
+                        touch(shared.start, shared.pages);
+                    }
                 }
                 const char byte = 1;
                 if (write(done[1], &byte, 1) != 1) {

@@ -4,6 +4,7 @@
 
 #include "model/memory_region.h"
 #include "targets/platform/linux/linux_platform.h"
+#include "targets/platform/linux/smaps_parser.h"
 #include "tests/support/run_program.h"
 
 #include <algorithm>
@@ -12,7 +13,9 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <link.h>
+#include <map>
 #include <optional>
+#include <set>
 #include <string>
 #include <tuple>
 #include <sys/mman.h>
@@ -118,7 +121,7 @@ TEST_F(LinuxProcessTest, ArrangedMemoryPageForPage) {
     const Expect expected[] = {
         {"a", 5, 5, 0, 0, vs::kShareModePrivate, 0, 0, ""},
         {"u", 0, 0, 0, 0, vs::kShareModeEmpty, 0, 0, ""},
-        {"f", 3, 0, 0, 0, vs::kShareModeCopyOnWrite, 0, 1, file},
+        {"f", 3, 0, 0, 0, vs::kShareModeShared, 0, 1, file},
         // Shared memory has no pager, yet it is a mapped file with a path.
         {"s", 4, 4, 0, 0, vs::kShareModeShared, vs::kTagDevZero, 0, "/dev/zero (deleted)"},
         {"p", 2, 2, 0, 0, vs::kShareModeShared, vs::kTagPosixSharedMemory, 0, "/dev/shm/" + shm},
@@ -215,11 +218,11 @@ TEST_F(LinuxProcessTest, SharedMappingIsOneObjectAcrossProcesses) {
         bool sameObject;
         std::optional<uint8_t> shareMode;
     };
-    // Private anonymous memory is an object of each process, even where
-    // fork left its pages shared copy-on-write.
+    // Until a run has resolved what its targets share, private anonymous
+    // memory is each process's own, even where fork left it shared.
     const Case cases[] = {{"s", true, vs::kShareModeShared},
                           {"f", true, std::nullopt},
-                          {"a", false, vs::kShareModeCopyOnWrite}};
+                          {"a", false, vs::kShareModePrivate}};
     for (const Case &c : cases) {
         const WalkedRegion *one = containing(parent, hex(child, c.label, "start"));
         const WalkedRegion *two = containing(grandchild, hex(child, c.label, "start"));
@@ -231,6 +234,164 @@ TEST_F(LinuxProcessTest, SharedMappingIsOneObjectAcrossProcesses) {
     const WalkedRegion *shared = containing(grandchild, hex(child, "s", "start"));
     EXPECT_EQ(shared->info.dirtiedPages, 4u);
     EXPECT_EQ(shared->info.inheritance, vs::kInheritShare);
+}
+
+TEST_F(LinuxProcessTest, PagesSharedByTargetsCountOnce) {
+    const std::string clean = makeCleanFile("vs_linux_test_private_file", 4);
+    const std::string big = makeCleanFile("vs_linux_test_big_file", 256);
+    // Page cache dirtied by write(), not yet written back.
+    const std::string dirtied = std::string(VESTAGE_TEST_BIN_DIR) + "/vs_linux_test_dirty_file";
+    {
+        const int fd = open(dirtied.c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+        const std::string bytes(4 * kPage, 'd');
+        ASSERT_EQ(write(fd, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+        close(fd);
+    }
+    const std::string shm = "/dev/shm/vs_linux_test_private_" + std::to_string(getpid());
+    {
+        const int fd = open(shm.c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+        ASSERT_EQ(ftruncate(fd, static_cast<off_t>(2 * kPage)), 0);
+        close(fd);
+    }
+    // A part: "own" for the mapping's own object, else a name; parts named
+    // alike must be one object in every process, parts named apart not.
+    struct Part {
+        std::string object;
+        uint32_t resident; // kUnion: the pages any of the item's mappings holds
+    };
+    // Faulting in a file page maps as many cached neighbours as the kernel
+    // likes; which pages each mapping holds is the kernel's pagemap.
+    constexpr uint32_t kUnion = UINT32_MAX;
+    struct Seen {
+        std::string process; // "" the child, else a grandchild's label
+        std::string item;
+        std::vector<Part> parts;
+    };
+    struct Scene {
+        const char *what;
+        std::vector<std::string> items;
+        std::vector<Seen> seen;
+    };
+    const Scene scenes[] = {
+        {"a fork family that only reads",
+         {"anon:a:64:64", "fork:g1", "fork:g2"},
+         {{"", "a", {{"S", 64}}}, {"g1", "a", {{"S", 64}}}, {"g2", "a", {{"S", 64}}}}},
+        {"one child writes a quarter: its own copies, the rest by exact set",
+         {"anon:a:64:64", "fork:g1:a:0:16", "fork:g2"},
+         {{"", "a", {{"PG2", 16}, {"ALL", 48}}},
+          {"g1", "a", {{"own", 16}, {"ALL", 48}}},
+          {"g2", "a", {{"PG2", 16}, {"ALL", 48}}}}},
+        {"a shared region written in parts by the children",
+         {"shared:s:64:0", "fork:g1:s:0:16", "fork:g2:s:16:16", "fork:g3:s:32:16"},
+         {{"", "s", {{"S", 48}}}, {"g1", "s", {{"S", 48}}}, {"g2", "s", {{"S", 48}}}, {"g3", "s", {{"S", 48}}}}},
+        {"a shared file written in parts", {"sfile:s:" + big, "fork:g1:s:0:1", "fork:g2:s:128:1"},
+         {{"", "s", {{"F", kUnion}}}, {"g1", "s", {{"F", kUnion}}}, {"g2", "s", {{"F", kUnion}}}}},
+        {"two private mappings of one file hold two sets of copies",
+         {"pfile:x:" + clean + ":4", "pfile:y:" + clean + ":4"},
+         {{"", "x", {{"own", 4}}}, {"", "y", {{"own", 4}}}}},
+        {"page cache dirtied by write() is the file's, not the reader's",
+         {"file:f:" + dirtied}, {{"", "f", {{"D", 4}}}}},
+        {"a private mapping of shmem written by two processes: copies of each",
+         {"pfile:p:" + shm + ":2", "fork:g1:p:0:2"},
+         {{"", "p", {{"own", 2}}}, {"g1", "p", {{"own", 2}}}}},
+    };
+    for (const Scene &scene : scenes) {
+        SCOPED_TRACE(scene.what);
+        VSLinuxPlatform run; // one run per scene: sets are of a run's targets
+        MemChild child(scene.items);
+        ASSERT_TRUE(child.ready());
+        std::map<std::string, VSTaskHandle> tasks;
+        for (const Seen &seen : scene.seen) {
+            if (!tasks.count(seen.process)) {
+                const int pid = seen.process.empty() ? child.pid() : std::stoi(child.fact(seen.process, "pid"));
+                VSTaskHandle task = 0;
+                ASSERT_EQ(run.task_handle_for_pid(pid, task), 0);
+                tasks[seen.process] = task;
+            }
+        }
+        for (const auto &[name, task] : tasks) {
+            run.prepare_task_walk(task);
+        }
+        ASSERT_TRUE(run.resolve_shared_pages());
+        // The pages of each item that any of its mappings has present.
+        std::map<std::string, std::vector<bool>> present;
+        for (const Seen &seen : scene.seen) {
+            const int pid = seen.process.empty() ? child.pid() : std::stoi(child.fact(seen.process, "pid"));
+            const uint64_t pages = hex(child, seen.item, "size") / kPage;
+            std::vector<uint64_t> entries(pages);
+            const int fd = open(("/proc/" + std::to_string(pid) + "/pagemap").c_str(), O_RDONLY | O_CLOEXEC);
+            ASSERT_EQ(pread(fd, entries.data(), pages * 8, static_cast<off_t>(hex(child, seen.item, "start") / kPage * 8)),
+                      static_cast<ssize_t>(pages * 8));
+            close(fd);
+            std::vector<bool> &bits = present[seen.item];
+            bits.resize(pages);
+            for (uint64_t i = 0; i < pages; ++i) {
+                bits[i] = bits[i] || (entries[i] >> 63) != 0;
+            }
+        }
+        std::map<std::string, uint32_t> unionPages;
+        for (const auto &[item, bits] : present) {
+            unionPages[item] = static_cast<uint32_t>(std::count(bits.begin(), bits.end(), true));
+        }
+        std::map<std::string, uint32_t> named;
+        std::set<uint32_t> objects;
+        for (const Seen &seen : scene.seen) {
+            SCOPED_TRACE(seen.process + " " + seen.item);
+            const VSTaskHandle task = tasks[seen.process];
+            const uint64_t start = hex(child, seen.item, "start");
+            std::vector<WalkedRegion> regions;
+            uint64_t address = start, size = 0;
+            uint32_t depth = vs::kUnlimitedDepth, count = vs::kRegionInfoCount;
+            VSRegionInfo first;
+            ASSERT_EQ(run.region_recurse(task, address, size, depth, first, count), 0);
+            ASSERT_EQ(address, start);
+            std::vector<VSRegionInfo> parts;
+            ASSERT_EQ(run.region_parts(task, start, parts), 0);
+            ASSERT_FALSE(parts.empty());
+            EXPECT_EQ(parts[0].objectId, first.objectId) << "the walk's record is the first part";
+            std::vector<std::pair<uint32_t, std::string>> got, want;
+            for (const VSRegionInfo &part : parts) {
+                if (part.shareMode == vs::kShareModeEmpty) {
+                    continue;
+                }
+                EXPECT_TRUE(objects.insert(part.objectId).second || part.shareMode == vs::kShareModeShared)
+                    << "an object of its own is no other part's";
+                got.emplace_back(part.residentPages, part.shareMode == vs::kShareModePrivate ? "own" : "shared");
+            }
+            for (const Part &part : seen.parts) {
+                want.emplace_back(part.resident == kUnion ? unionPages[seen.item] : part.resident,
+                                  part.object == "own" ? "own" : "shared");
+            }
+            std::sort(got.begin(), got.end());
+            std::sort(want.begin(), want.end());
+            EXPECT_EQ(got, want);
+            // Named parts: the same object wherever the name appears.
+            for (const Part &part : seen.parts) {
+                if (part.object == "own") {
+                    continue;
+                }
+                const uint32_t resident = part.resident == kUnion ? unionPages[seen.item] : part.resident;
+                const auto match = std::find_if(parts.begin(), parts.end(), [&](const VSRegionInfo &p) {
+                    return p.residentPages == resident && p.shareMode == vs::kShareModeShared;
+                });
+                ASSERT_NE(match, parts.end());
+                const auto [entry, added] = named.emplace(part.object, match->objectId);
+                EXPECT_EQ(entry->second, match->objectId) << part.object << " is one object";
+                for (const auto &[other, id] : named) {
+                    if (other != part.object) {
+                        EXPECT_NE(id, match->objectId) << part.object << " and " << other << " are two";
+                    }
+                }
+            }
+        }
+        for (const auto &[name, task] : tasks) {
+            run.release_task_handle(task);
+        }
+    }
+    unlink(shm.c_str());
+    unlink(dirtied.c_str());
+    unlink(big.c_str());
+    unlink(clean.c_str());
 }
 
 TEST_F(LinuxProcessTest, SharedLibrarySegments) {

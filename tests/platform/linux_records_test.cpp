@@ -12,6 +12,7 @@
 #include <cstring>
 #include <elf.h>
 #include <gtest/gtest.h>
+#include <optional>
 #include <string>
 #include <tuple>
 
@@ -46,11 +47,11 @@ TEST(LinuxRegionRecords, RecordFieldsFromSmaps) {
         {"a swapped-out region is not empty", "1000-9000 rw-p 0 00:00 0 \nSwap: 8 kB\nVmFlags: rd wr mr mw me\n", {},
          0, kPrivate, 0, kCopy, 3, 7, 0, 0, 2, 0},
         {"a file keeps its offset", "1000-4000 r--p 00002000 fe:00 99 /usr/lib/x.so\nRss: 12 kB\nVmFlags: rd mr mw me\n",
-         {}, 0, vs::kShareModeCopyOnWrite, 1, kCopy, 1, 7, 0x2000, 3, 0, 0},
+         {}, 0, kShared, 1, kCopy, 1, 7, 0x2000, 3, 0, 0},
         {"memfd keeps its offset", "1000-5000 rw-s 00003000 00:01 7 /memfd:x (deleted)\nRss: 4 kB\nVmFlags: rd wr sh\n",
          {}, vs::kTagMemfd, kShared, 0, kShare, 3, 0, 0x3000, 1, 0, 0},
         {"SysV segment", "1000-5000 rw-s 0 00:01 8 /SYSV00000001 (deleted)\nVmFlags: rd wr sh\n", {},
-         vs::kTagSysVSharedMemory, kShared, 0, kShare, 3, 0, 0, 0, 0, 0},
+         vs::kTagSysVSharedMemory, kEmpty, 0, kShare, 3, 0, 0, 0, 0, 0},
         // 300000 locked pages do not fit the 16-bit count; Locked is not what counts.
         {"locked beyond the count", "0-100000000 rw-p 0 00:00 0 \nRss: 1200000 kB\nLocked: 4 kB\nVmFlags: rd wr lo\n",
          {}, 0, kPrivate, 0, kCopy, 3, 0, 0, 300000, 0, 0xFFFF},
@@ -62,10 +63,18 @@ TEST(LinuxRegionRecords, RecordFieldsFromSmaps) {
          kCopy, 3, 7, 0, 0, 0, 0},
         {"brk area", "1000-9000 rw-p 0 00:00 0 [heap]\nVmFlags: rd wr\n", {}, vs::kTagSbrk, kEmpty, 0, kCopy, 3, 0, 0,
          0, 0, 0},
+        // User-level threads run on malloc'd stacks: the heap stays the heap.
+        {"a stack pointer in the brk area", "1000-9000 rw-p 0 00:00 0 [heap]\nVmFlags: rd wr\n", {0x2000},
+         vs::kTagSbrk, kEmpty, 0, kCopy, 3, 0, 0, 0, 0, 0},
+        {"a stack pointer in a file mapping", "1000-9000 rw-p 0 fe:00 99 /x\nVmFlags: rd wr\n", {0x2000}, 0, kEmpty,
+         1, kCopy, 3, 0, 0, 0, 0, 0},
+        {"hugetlb pages count though Rss leaves them out",
+         "1000-401000 rw-p 0 00:10 77 /anon_hugepage (deleted)\nPrivate_Hugetlb: 4096 kB\nVmFlags: rd wr ht\n", {},
+         vs::kTagHugetlb, kPrivate, 0, kCopy, 3, 0, 0, 1024, 0, 0},
         {"vdso is one object shared by every process",
          "1000-3000 r-xp 0 00:00 0 [vdso]\nRss: 8 kB\nShared_Clean: 8 kB\nVmFlags: rd ex mr mw me de\n", {},
          vs::kTagVdso, kShared, 0, kCopy, 5, 7, 0, 2, 0, 0},
-        {"vsyscall", "1000-3000 --xp 0 00:00 0 [vsyscall]\nVmFlags: ex\n", {}, vs::kTagVsyscall, kShared, 0, kCopy, 4,
+        {"vsyscall", "1000-3000 --xp 0 00:00 0 [vsyscall]\nVmFlags: ex\n", {}, vs::kTagVsyscall, kEmpty, 0, kCopy, 4,
          0, 0, 0, 0, 0},
         {"not inherited by a child", "1000-3000 rw-p 0 00:00 0 \nVmFlags: rd wr mr mw me dc\n", {}, 0, kEmpty, 0,
          vs::kInheritNone, 3, 7, 0, 0, 0, 0},
@@ -76,8 +85,9 @@ TEST(LinuxRegionRecords, RecordFieldsFromSmaps) {
         SCOPED_TRACE(c.what);
         const SmapsRegion region = parseOne(c.text);
         const vs::MappingKind kind = vs::mappingKind(region, {});
+        vs::ObjectIdTable ids;
         const VSRegionInfo info =
-            vs::regionInfoFor(region, kind, vs::userTagFor(region, kind, c.stackPointers), 7, kPage);
+            vs::regionPartsFor(region, kind, vs::userTagFor(region, kind, c.stackPointers), ids, kPage).at(0);
         EXPECT_EQ(info.userTag, c.tag);
         EXPECT_EQ(info.shareMode, c.shareMode);
         EXPECT_EQ(info.externalPager, c.externalPager);
@@ -109,26 +119,112 @@ TEST(LinuxRegionRecords, NamedAnonymousMemoryGetsItsOwnTag) {
     }
 }
 
-TEST(LinuxObjectIds, OnePerFileOneNamePerKernelMappingFreshForAnonymous) {
+TEST(LinuxRegionRecords, PartsOfOneMappingEachInOneObject) {
+    // What a part is: which object (by what it stands for), where in it,
+    // and its pages.
+    struct Part {
+        std::string object; // stable identity, "own" for a fresh object, "set" for the shared set's
+        uint64_t offset;
+        uint32_t resident, dirty, swapped, reusable;
+        uint8_t shareMode, externalPager;
+    };
+    struct Case {
+        const char *what;
+        std::string text;
+        std::vector<vs::SharedAnonymousPart> shared;
+        std::optional<vs::ObjectPages> objectPages;
+        std::vector<Part> parts;
+    };
+    constexpr uint8_t kPrivate = vs::kShareModePrivate, kEmpty = vs::kShareModeEmpty, kShared = vs::kShareModeShared;
+    const uint32_t kSetObject = 1000; // outside the ids a fresh table hands out here
+    const Case cases[] = {
+        {"anonymous memory: all dirty but what was given back",
+         "1000-9000 rw-p 0 00:00 0 \nRss: 32 kB\nAnonymous: 32 kB\nPrivate_Dirty: 28 kB\nPrivate_Clean: 4 kB\n"
+         "LazyFree: 4 kB\nSwap: 8 kB\nVmFlags: rd wr\n",
+         {}, {}, {{"own", 0, 8, 7, 2, 1, kPrivate, 0}}},
+        {"a private file mapping: page cache beside the copies",
+         "1000-5000 rw-p 00001000 fe:00 99 /x\nRss: 16 kB\nAnonymous: 8 kB\nPrivate_Clean: 8 kB\n"
+         "Private_Dirty: 8 kB\nVmFlags: rd wr\n",
+         {}, {}, {{"file 254:0 inode 99 offset 4096", 0x1000, 2, 0, 0, 0, kShared, 1}, {"own", 0, 2, 2, 0, 0, kPrivate, 0}}},
+        {"page cache dirtied by write() is the file's, mapped privately or not",
+         "1000-5000 r--p 0 fe:00 99 /x\nRss: 8 kB\nShared_Dirty: 4 kB\nPrivate_Dirty: 4 kB\nVmFlags: rd\n", {}, {},
+         {{"file 254:0 inode 99 offset 0", 0, 2, 2, 0, 0, kShared, 1}}},
+        {"a private mapping of a shmem file: its copies are its own, its pages not droppable",
+         "1000-5000 rw-p 0 00:01 12 /dev/shm/pool\nRss: 8 kB\nAnonymous: 4 kB\nShared_Clean: 4 kB\n"
+         "Private_Dirty: 4 kB\nVmFlags: rd wr\n",
+         {}, {}, {{"file 0:1 inode 12 offset 0", 0, 1, 0, 0, 0, kShared, 0}, {"own", 0, 1, 1, 0, 0, kPrivate, 0}}},
+        {"anonymous pages shared after fork go to the set, at the mapping's address",
+         "1000-9000 rw-p 0 00:00 0 \nRss: 24 kB\nAnonymous: 24 kB\nShared_Dirty: 20 kB\nPrivate_Dirty: 4 kB\n"
+         "Swap: 8 kB\nSwapPss: 4 kB\nVmFlags: rd wr\n",
+         {{kSetObject, 5, 1}}, {},
+         {{"own", 0, 1, 1, 1, 0, kPrivate, 0}, {"set", 0x1000, 5, 5, 1, 0, kShared, 0}}},
+        {"all shared: no own part",
+         "1000-3000 rw-p 0 00:00 0 \nRss: 8 kB\nAnonymous: 8 kB\nShared_Dirty: 8 kB\nVmFlags: rd wr\n",
+         {{kSetObject, 2, 0}}, {}, {{"set", 0x1000, 2, 2, 0, 0, kShared, 0}}},
+        {"a shared mapping touched in parts counts the object's pages in its range",
+         "1000-11000 rw-s 0 00:01 12 /dev/shm/pool\nRss: 16 kB\nShared_Dirty: 16 kB\nVmFlags: rd wr sh\n", {},
+         vs::ObjectPages{16, 16}, {{"file 0:1 inode 12", 0, 16, 16, 0, 0, kShared, 0}}},
+        {"nothing resident: one empty part", "1000-5000 rw-p 0 fe:00 99 /x\nVmFlags: rd wr\n", {}, {},
+         {{"file 254:0 inode 99 offset 0", 0, 0, 0, 0, 0, kEmpty, 1}}},
+        {"kernel pages are one object by name", "1000-3000 r-xp 0 00:00 0 [vdso]\nRss: 8 kB\nVmFlags: rd ex\n", {}, {},
+         {{"kernel mapping [vdso]", 0, 2, 0, 0, 0, kShared, 0}}},
+    };
+    for (const Case &c : cases) {
+        SCOPED_TRACE(c.what);
+        vs::ObjectIdTable ids;
+        const SmapsRegion region = parseOne(c.text);
+        const vs::MappingKind kind = vs::mappingKind(region, {});
+        const std::vector<VSRegionInfo> parts =
+            vs::regionPartsFor(region, kind, 0, ids, kPage, c.shared, c.objectPages);
+        ASSERT_EQ(parts.size(), c.parts.size());
+        std::vector<uint32_t> objects;
+        for (size_t i = 0; i < parts.size(); ++i) {
+            const VSRegionInfo &got = parts[i];
+            const Part &want = c.parts[i];
+            SCOPED_TRACE(i);
+            if (want.object == "set") {
+                EXPECT_EQ(got.objectId, kSetObject);
+            } else if (want.object == "own") {
+                EXPECT_NE(got.objectId, 0u);
+                EXPECT_EQ(ids.stableIdentity(got.objectId), std::nullopt);
+            } else {
+                EXPECT_EQ(ids.stableIdentity(got.objectId).value_or("none"), want.object);
+            }
+            objects.push_back(got.objectId);
+            EXPECT_EQ(std::make_tuple(got.offset, got.residentPages, got.dirtiedPages, got.swappedOutPages,
+                                      got.reusablePages, got.shareMode, got.externalPager),
+                      std::make_tuple(want.offset, want.resident, want.dirty, want.swapped, want.reusable,
+                                      want.shareMode, want.externalPager));
+        }
+        std::sort(objects.begin(), objects.end());
+        EXPECT_EQ(std::adjacent_find(objects.begin(), objects.end()), objects.end()) << "one object per part";
+    }
+}
+
+TEST(LinuxObjectIds, WhatMakesTwoMappingsOneObject) {
     vs::ObjectIdTable ids;
     auto id = [&](const char *header) {
-        const SmapsRegion region = parseOne(std::string(header) + "\n");
-        return vs::objectIdFor(region, vs::mappingKind(region, {}), ids);
+        const SmapsRegion region = parseOne(std::string(header) + "\nRss: 4 kB\n");
+        return vs::regionPartsFor(region, vs::mappingKind(region, {}), 0, ids, kPage).at(0).objectId;
     };
     const uint32_t libcText = id("1000-2000 r-xp 00026000 fe:00 332835 /usr/lib/libc.so.6");
-    const uint32_t otherDevice = id("1000-2000 r-xp 00000000 fe:01 332835 /mnt/libc.so.6");
+    const uint32_t libcData = id("5000-6000 rw-p 001d3000 fe:00 332835 /usr/lib/libc.so.6");
+    const uint32_t otherDevice = id("1000-2000 r-xp 00026000 fe:01 332835 /mnt/libc.so.6");
     const uint32_t shared = id("1000-2000 rw-s 00000000 00:01 1025 /dev/zero (deleted)");
     const uint32_t vdso = id("1000-2000 r-xp 00000000 00:00 0 [vdso]");
     const uint32_t vvar = id("5000-6000 r--p 00000000 00:00 0 [vvar]");
     const uint32_t anon = id("1000-2000 rw-p 00000000 00:00 0 ");
-    EXPECT_EQ(id("5000-6000 rw-p 001d3000 fe:00 332835 /usr/lib/libc.so.6"), libcText);
-    EXPECT_EQ(id("8000-9000 rw-s 00000000 00:01 1025 /dev/zero (deleted)"), shared);
+    EXPECT_EQ(id("7000-8000 r-xp 00026000 fe:00 332835 /usr/lib/libc.so.6"), libcText) << "same window";
+    EXPECT_EQ(id("8000-9000 rw-s 00001000 00:01 1025 /dev/zero (deleted)"), shared) << "one shared object";
     EXPECT_EQ(id("3000-4000 r-xp 00000000 00:00 0 [vdso]"), vdso);
     const uint32_t anonAgain = id("1000-2000 rw-p 00000000 00:00 0 ");
     const uint32_t heap = id("1000-2000 rw-p 00000000 00:00 0 [heap]");
-    std::vector<uint32_t> distinct = {libcText, otherDevice, shared, vdso, vvar, anon, anonAgain, heap};
+    std::vector<uint32_t> distinct = {libcText, libcData, otherDevice, shared, vdso, vvar, anon, anonAgain, heap};
     std::sort(distinct.begin(), distinct.end());
-    EXPECT_EQ(distinct, (std::vector<uint32_t>{1, 2, 3, 4, 5, 6, 7, 8})) << "distinct, dense, never 0";
+    EXPECT_EQ(distinct, (std::vector<uint32_t>{1, 2, 3, 4, 5, 6, 7, 8, 9})) << "distinct, dense, never 0";
+    EXPECT_EQ(ids.idForFrameSet(3, 0x1000), ids.idForFrameSet(3, 0x1000));
+    EXPECT_NE(ids.idForFrameSet(3, 0x1000), ids.idForFrameSet(4, 0x1000));
+    EXPECT_NE(ids.idForFrameSet(3, 0x1000), ids.idForFrameSet(3, 0x2000));
 }
 
 TEST(LinuxElfImages, SegmentsAndBias) {

@@ -56,7 +56,17 @@ struct VSLinuxPlatform::Task {
     VSReturnCode parseCode = 0;
     std::vector<SmapsRegion> regions;
     std::vector<vs::MappingKind> kinds;
-    std::vector<VSRegionInfo> infos;
+    std::vector<uint32_t> tags;
+    // The records of every region, one per part: region i's parts are
+    // parts[firstPart[i]] to parts[firstPart[i + 1]]. Built on the first
+    // region query, after the run's shared pages are resolved.
+    bool partsBuilt = false;
+    std::vector<VSRegionInfo> parts;
+    std::vector<uint32_t> firstPart;
+
+    // Prepared for the run's shared-page resolution: its pages are in the
+    // index, so its walk looks them up there (kept across parses).
+    bool prepared = false;
     // The status read for the kernel-memory counters, kept for the one
     // resource-usage query that a target makes right after it (both are
     // taken at construction); used once, then dropped.
@@ -791,23 +801,260 @@ VSReturnCode VSLinuxPlatform::_parse(Task &task) {
     }
     const std::vector<uint64_t> stackPointers = threadStackPointers(task.dir.get());
     const std::vector<uint64_t> &tmpfs = _tmpfsDevices();
-    vs::ObjectIdTable &ids = vs::ObjectIdTable::shared();
     task.kinds.reserve(task.regions.size());
-    task.infos.reserve(task.regions.size());
+    task.tags.reserve(task.regions.size());
     for (const SmapsRegion &region : task.regions) {
         const vs::MappingKind kind = vs::mappingKind(region, tmpfs);
-        const uint32_t tag = vs::userTagFor(region, kind, stackPointers);
-        const uint32_t objectId = vs::objectIdFor(region, kind, ids);
         task.kinds.push_back(kind);
-        task.infos.push_back(vs::regionInfoFor(region, kind, tag, objectId, _pageSize));
+        task.tags.push_back(vs::userTagFor(region, kind, stackPointers));
     }
     return 0;
+}
+
+void VSLinuxPlatform::_buildParts(Task &task) {
+    if (task.partsBuilt) {
+        return;
+    }
+    vs::ObjectIdTable &ids = vs::ObjectIdTable::shared();
+    task.parts.clear();
+    task.firstPart.clear();
+    task.parts.reserve(task.regions.size() + task.regions.size() / 4);
+    task.firstPart.reserve(task.regions.size() + 1);
+    const bool resolved = task.prepared && _sharedPagesResolved.load();
+    UniqueFd pagemap;
+    bool pagemapFailed = false;
+    std::vector<vs::SharedAnonymousPart> shared;
+    std::vector<uint64_t> keys;
+    std::vector<uint32_t> sets;
+    for (uint32_t i = 0; i < task.regions.size(); ++i) {
+        const SmapsRegion &region = task.regions[i];
+        const vs::MappingKind kind = task.kinds[i];
+        shared.clear();
+        std::optional<vs::ObjectPages> objectPages;
+        if (resolved && vs::mayShareAnonymousPages(region, kind) && !pagemapFailed) {
+            // A second look at the frames: the index knows which sets they
+            // are in now that every target has been seen.
+            if (!pagemap.valid()) {
+                pagemap = UniqueFd(::openat(task.dir.get(), "pagemap", O_RDONLY | O_CLOEXEC));
+                pagemapFailed = !pagemap.valid();
+            }
+            if (pagemap.valid()) {
+                keys.clear();
+                _candidateKeys(pagemap.get(), region, keys, nullptr);
+                _sharedPages.sharedSets(keys, sets);
+                for (size_t k = 0; k < keys.size(); ++k) {
+                    if (sets[k] == vs::SharedPageIndex::kNoSet) {
+                        continue; // no other target maps it: the mapping's own
+                    }
+                    const uint32_t objectId = ids.idForFrameSet(sets[k], region.start);
+                    auto set = std::find_if(shared.begin(), shared.end(),
+                                            [&](const vs::SharedAnonymousPart &p) { return p.objectId == objectId; });
+                    if (set == shared.end()) {
+                        set = shared.insert(shared.end(), vs::SharedAnonymousPart{objectId, 0, 0});
+                    }
+                    ((keys[k] & vs::kSwapKey) != 0 ? set->swappedPages : set->presentPages) += 1;
+                }
+            }
+        } else if (resolved && _isSharedWindow(region, kind)) {
+            const uint64_t first = region.offset / _pageSize;
+            if (auto pages = _sharedPages.objectPages(deviceNumber(region.devMajor, region.devMinor), region.inode, first,
+                                                      region.size() / _pageSize)) {
+                objectPages = vs::ObjectPages{pages->resident, pages->dirty};
+            }
+        }
+        task.firstPart.push_back(static_cast<uint32_t>(task.parts.size()));
+        for (VSRegionInfo &part : vs::regionPartsFor(region, kind, task.tags[i], ids, _pageSize, shared, objectPages)) {
+            task.parts.push_back(part);
+        }
+    }
+    task.firstPart.push_back(static_cast<uint32_t>(task.parts.size()));
+    task.partsBuilt = true;
+}
+
+bool VSLinuxPlatform::_isSharedWindow(const SmapsRegion &region, vs::MappingKind kind) const {
+    return region.shared && region.inode != 0 && !region.hasFlag(vs::kVmHugetlb) &&
+           (kind == vs::MappingKind::File || kind == vs::MappingKind::SharedMemory);
+}
+
+void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, std::vector<uint64_t> &keys,
+                                     bool *framesUnreadable) {
+    constexpr uint64_t kPresent = 1ull << 63;
+    constexpr uint64_t kSwapped = 1ull << 62;
+    constexpr uint64_t kFileOrSharedAnon = 1ull << 61;
+    constexpr uint64_t kGuard = 1ull << 58;
+    constexpr uint64_t kExclusive = 1ull << 56;
+    constexpr uint64_t kPfnMask = (1ull << 55) - 1;
+    _readPagemap(pagemapFd, region.start, region.size() / _pageSize,
+                 [&](std::span<const uint64_t> entries, uint64_t) {
+                     for (const uint64_t entry : entries) {
+                         uint64_t key = 0;
+                         if ((entry & kPresent) != 0) {
+                             // Page cache of a file mapping, and pages only
+                             // this process maps, are never in a set.
+                             if ((entry & (kFileOrSharedAnon | kExclusive)) != 0) {
+                                 continue;
+                             }
+                             key = entry & kPfnMask;
+                         } else if ((entry & kSwapped) != 0 && (entry & kGuard) == 0) {
+                             key = (entry & kPfnMask) == 0 ? 0 : (vs::kSwapKey | (entry & kPfnMask));
+                         } else {
+                             continue;
+                         }
+                         if (key == 0) {
+                             // Frame numbers are hidden from this reader.
+                             if (framesUnreadable != nullptr) {
+                                 *framesUnreadable = true;
+                             }
+                             continue;
+                         }
+                         keys.push_back(key);
+                     }
+                     return true;
+                 });
+}
+
+bool VSLinuxPlatform::_readPagemap(int pagemapFd, uint64_t address, uint64_t pages,
+                                   const std::function<bool(std::span<const uint64_t>, uint64_t)> &batch) {
+    constexpr uint64_t kBatch = 16384; // 128 KiB of entries per read
+    std::vector<uint64_t> entries(std::min(pages, kBatch));
+    for (uint64_t done = 0; done < pages;) {
+        const uint64_t want = std::min(pages - done, kBatch);
+        const off_t offset = static_cast<off_t>((address / _pageSize + done) * sizeof(uint64_t));
+        const ssize_t n = ::pread(pagemapFd, entries.data(), want * sizeof(uint64_t), offset);
+        if (n <= 0) {
+            return false;
+        }
+        const uint64_t got = static_cast<uint64_t>(n) / sizeof(uint64_t);
+        if (!batch(std::span<const uint64_t>(entries.data(), got), done)) {
+            return true;
+        }
+        done += got;
+        if (got < want) {
+            break;
+        }
+    }
+    return true;
+}
+
+bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
+    auto task = _task(handle);
+    if (!task) {
+        return false;
+    }
+    std::lock_guard<std::mutex> lock(task->mutex);
+    if (_ensureParsed(*task) != 0 || task->prepared) {
+        return task->prepared;
+    }
+    constexpr uint64_t kPresent = 1ull << 63;
+    constexpr uint64_t kPfnMask = (1ull << 55) - 1;
+    UniqueFd pagemap;
+    std::vector<uint64_t> keys;
+    std::vector<uint64_t> pfns;
+    bool framesUnreadable = false;
+    bool any = false;
+    for (size_t i = 0; i < task->regions.size(); ++i) {
+        const SmapsRegion &region = task->regions[i];
+        const vs::MappingKind kind = task->kinds[i];
+        const bool anonymous = vs::mayShareAnonymousPages(region, kind);
+        const bool window = !anonymous && _isSharedWindow(region, kind);
+        if (!anonymous && !window) {
+            continue;
+        }
+        any = true;
+        if (!pagemap.valid()) {
+            pagemap = UniqueFd(::openat(task->dir.get(), "pagemap", O_RDONLY | O_CLOEXEC));
+            if (!pagemap.valid()) {
+                // The walk reports the process; nothing to share from it.
+                return false;
+            }
+        }
+        if (anonymous) {
+            keys.clear();
+            _candidateKeys(pagemap.get(), region, keys, &framesUnreadable);
+            _sharedPages.addPages(task->pid, keys);
+            continue;
+        }
+        // A shared mapping: which file pages it holds, and which of them are
+        // dirty (shmem pages are all dirty; page cache says per frame).
+        vs::SharedPageIndex::Window pages;
+        pages.device = deviceNumber(region.devMajor, region.devMinor);
+        pages.inode = region.inode;
+        pages.firstPage = region.offset / _pageSize;
+        pages.pageCount = region.size() / _pageSize;
+        pages.dirtyCount = (region.privateDirty + region.sharedDirty) / _pageSize;
+        const bool shmem = kind == vs::MappingKind::SharedMemory;
+        const bool whole = region.rss == region.size();
+        if (region.rss == 0) {
+            pages.present.assign(1, 0);
+        } else if (!whole || !shmem) {
+            pages.present.assign((pages.pageCount + 63) / 64, 0);
+            pfns.clear();
+            _readPagemap(pagemap.get(), region.start, pages.pageCount,
+                         [&](std::span<const uint64_t> entries, uint64_t first) {
+                             for (size_t k = 0; k < entries.size(); ++k) {
+                                 if ((entries[k] & kPresent) != 0) {
+                                     pages.present[(first + k) / 64] |= 1ull << ((first + k) % 64);
+                                     pfns.push_back(entries[k] & kPfnMask);
+                                 }
+                             }
+                             return true;
+                         });
+            if (!shmem && !pfns.empty() && pfns.front() != 0) {
+                _dirtyFrames(pfns, pages.present, pages.dirty);
+            }
+        }
+        if (shmem) {
+            pages.dirty = pages.present.empty() ? std::vector<uint64_t>((pages.pageCount + 63) / 64, ~0ull)
+                                                : pages.present;
+        }
+        _sharedPages.addWindow(pages);
+    }
+    if (framesUnreadable) {
+        _sharedFramesUnreadable.store(true);
+    }
+    task->prepared = true;
+    task->partsBuilt = false;
+    return any;
+}
+
+void VSLinuxPlatform::_dirtyFrames(const std::vector<uint64_t> &pfns, const std::vector<uint64_t> &present,
+                                   std::vector<uint64_t> &dirty) {
+    std::call_once(_kpageflagsOnce, [this] {
+        _kpageflagsFd = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC);
+    });
+    if (_kpageflagsFd < 0) {
+        return;
+    }
+    constexpr uint64_t kDirtyPageFlag = 1ull << 4;
+    dirty.assign(present.size(), 0);
+    // pfns are in page order, one per set bit of `present`.
+    size_t next = 0;
+    uint64_t flags = 0;
+    for (uint64_t page = 0; page < present.size() * 64 && next < pfns.size(); ++page) {
+        if ((present[page / 64] >> (page % 64) & 1) == 0) {
+            continue;
+        }
+        const uint64_t pfn = pfns[next++];
+        if (::pread(_kpageflagsFd, &flags, sizeof flags, static_cast<off_t>(pfn * sizeof flags)) ==
+                static_cast<ssize_t>(sizeof flags) &&
+            (flags & kDirtyPageFlag) != 0) {
+            dirty[page / 64] |= 1ull << (page % 64);
+        }
+    }
+}
+
+bool VSLinuxPlatform::resolve_shared_pages() {
+    _sharedPagesResolved.store(true);
+    return !_sharedFramesUnreadable.load();
 }
 
 void VSLinuxPlatform::_releaseParse(Task &task) {
     std::vector<SmapsRegion>().swap(task.regions);
     std::vector<vs::MappingKind>().swap(task.kinds);
-    std::vector<VSRegionInfo>().swap(task.infos);
+    std::vector<uint32_t>().swap(task.tags);
+    std::vector<VSRegionInfo>().swap(task.parts);
+    std::vector<uint32_t>().swap(task.firstPart);
+    task.partsBuilt = false;
     task.parsed = false;
     task.parseCode = 0;
 }
@@ -843,11 +1090,33 @@ VSReturnCode VSLinuxPlatform::region_recurse(VSTaskHandle handle, uint64_t &addr
         _releaseParse(*task);
         return vs::kReturnNoMoreRegions;
     }
+    _buildParts(*task);
     address = task->regions[i].start;
     size = task->regions[i].size();
     depth = 0;
-    info = task->infos[i];
+    info = task->parts[task->firstPart[i]];
     infoCount = vs::kRegionInfoCount;
+    return 0;
+}
+
+VSReturnCode VSLinuxPlatform::region_parts(VSTaskHandle handle, uint64_t address,
+                                           std::vector<VSRegionInfo> &parts) {
+    parts.clear();
+    auto task = _task(handle);
+    if (!task) {
+        return vs::kReturnDeadPort;
+    }
+    std::lock_guard<std::mutex> lock(task->mutex);
+    const VSReturnCode code = _ensureParsed(*task);
+    if (code != 0) {
+        return code;
+    }
+    const size_t i = regionAtOrAbove(task->regions, address);
+    if (i >= task->regions.size() || task->regions[i].start > address) {
+        return vs::kReturnNoMoreRegions;
+    }
+    _buildParts(*task);
+    parts.assign(task->parts.begin() + task->firstPart[i], task->parts.begin() + task->firstPart[i + 1]);
     return 0;
 }
 

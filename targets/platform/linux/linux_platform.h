@@ -17,8 +17,12 @@
 // process that has gone; 0x10000003 when a region query finds the process
 // gone (reaped, or a zombie whose smaps reads empty); otherwise the errno.
 
+#include "targets/platform/linux/shared_pages.h"
 #include "targets/platform/platform.h"
 
+#include <atomic>
+#include <functional>
+#include <span>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -30,6 +34,7 @@
 
 namespace vs {
 struct SmapsRegion;
+enum class MappingKind : uint8_t;
 class ObjectIdTable;
 class ElfCache;
 } // namespace vs
@@ -57,6 +62,9 @@ public:
     VSReturnCode region_info(VSTaskHandle task, uint64_t &address, uint64_t &size, int32_t flavor,
                              VSRegionBasicInfo &info, uint32_t &infoCount,
                              uint32_t &objectName) override;
+    VSReturnCode region_parts(VSTaskHandle task, uint64_t address, std::vector<VSRegionInfo> &parts) override;
+    bool prepare_task_walk(VSTaskHandle task) override;
+    bool resolve_shared_pages() override;
     VSReturnCode page_range_query(VSTaskHandle task, uint64_t address, uint64_t length,
                                   std::span<int32_t> dispositions, uint64_t &count) override;
     VSReturnCode purgeable_control(VSTaskHandle task, uint64_t address, int32_t operation,
@@ -107,6 +115,22 @@ private:
     VSReturnCode _parse(Task &task);
     // Forgets the parse; the next region query parses again.
     void _releaseParse(Task &task);
+    // The records of every region's parts, from the parse and, once the
+    // run's shared pages are resolved, the shared-page index.
+    void _buildParts(Task &task);
+    bool _isSharedWindow(const vs::SmapsRegion &region, vs::MappingKind kind) const;
+    // The keys (frame, or swap entry) of a private mapping's anonymous
+    // pages that other processes may map too.
+    void _candidateKeys(int pagemapFd, const vs::SmapsRegion &region, std::vector<uint64_t> &keys,
+                        bool *framesUnreadable);
+    // Reads pagemap entries of `pages` pages from `address` in large
+    // batches; `batch` gets each with the index of its first page and
+    // returns false to stop. False when nothing could be read.
+    bool _readPagemap(int pagemapFd, uint64_t address, uint64_t pages,
+                      const std::function<bool(std::span<const uint64_t>, uint64_t)> &batch);
+    // Dirty bits of present frames (pfns in page order), from kpageflags.
+    void _dirtyFrames(const std::vector<uint64_t> &pfns, const std::vector<uint64_t> &present,
+                      std::vector<uint64_t> &dirty);
     // The mount table, read once: tmpfs devices, and which devices hold
     // file systems whose files may be opened for a header probe.
     void _readMounts();
@@ -136,6 +160,10 @@ private:
     std::once_flag _mountsOnce;
     std::vector<uint64_t> _tmpfs;
     std::unordered_map<uint64_t, bool> _openable;
+
+    vs::SharedPageIndex _sharedPages;
+    std::atomic<bool> _sharedPagesResolved{false};
+    std::atomic<bool> _sharedFramesUnreadable{false};
 
     std::once_flag _kpageflagsOnce;
     int _kpageflagsFd = -1;

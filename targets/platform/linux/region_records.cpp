@@ -45,16 +45,16 @@ bool holdsStackPointer(const SmapsRegion &region, const std::vector<uint64_t> &s
     return it != stackPointers.end() && *it < region.end;
 }
 
-uint32_t pages(uint64_t bytes, uint64_t pageSize) {
-    const uint64_t count = bytes / pageSize;
-    return count > UINT32_MAX ? UINT32_MAX : static_cast<uint32_t>(count);
-}
-
 } // namespace
 
 uint32_t userTagFor(const SmapsRegion &region, MappingKind kind,
                     const std::vector<uint64_t> &stackPointers) {
     const std::string_view path = region.path;
+    // Hugetlbfs files and MAP_HUGETLB memory alike: neither page cache nor
+    // swappable.
+    if (region.hasFlag(kVmHugetlb)) {
+        return kTagHugetlb;
+    }
     switch (kind) {
     case MappingKind::File:
         return 0;
@@ -74,11 +74,14 @@ uint32_t userTagFor(const SmapsRegion &region, MappingKind kind,
     case MappingKind::Anonymous:
         break;
     }
-    if (path == "[stack]" || holdsStackPointer(region, stackPointers)) {
-        return kTagStack;
-    }
+    // The brk heap stays "sbrk" even when a thread runs on a stack carved out
+    // of it (user-level threads); only plain anonymous memory is named after
+    // the stack pointers in it.
     if (path == "[heap]") {
         return kTagSbrk;
+    }
+    if (path == "[stack]" || (path.empty() && holdsStackPointer(region, stackPointers))) {
+        return kTagStack;
     }
     if (path == "[uprobes]") {
         return kTagUprobes;
@@ -95,25 +98,28 @@ uint32_t userTagFor(const SmapsRegion &region, MappingKind kind,
     return 0;
 }
 
-uint32_t objectIdFor(const SmapsRegion &region, MappingKind kind, ObjectIdTable &ids) {
-    switch (kind) {
-    case MappingKind::File:
-    case MappingKind::SharedMemory:
-        if (region.inode != 0) {
-            return ids.idForFile((uint64_t{region.devMajor} << 32) | region.devMinor,
-                                 region.inode);
-        }
-        return ids.freshId(); // [anon_shmem:NAME] shows no inode
-    case MappingKind::Special:
-        return ids.idForName(region.path);
-    case MappingKind::Anonymous:
-        break;
+bool mayShareAnonymousPages(const SmapsRegion &region, MappingKind kind) {
+    if (region.shared || kind == MappingKind::Special || region.hasFlag(kVmHugetlb)) {
+        return false;
     }
-    return ids.freshId();
+    // Anonymous pages mapped more than once show as shared; so do the page
+    // cache pages of a file mapping, which only the frames tell apart.
+    // Swap entries that several processes hold bring SwapPss below Swap.
+    return (region.anonymous > 0 && region.sharedClean + region.sharedDirty > 0) || region.swap > region.swapPss;
 }
 
-VSRegionInfo regionInfoFor(const SmapsRegion &region, MappingKind kind, uint32_t userTag,
-                           uint32_t objectId, uint64_t pageSize) {
+namespace {
+
+uint32_t pagesOf(uint64_t count) {
+    return count > UINT32_MAX ? UINT32_MAX : static_cast<uint32_t>(count);
+}
+
+uint64_t deviceOf(const SmapsRegion &region) {
+    return (uint64_t{region.devMajor} << 32) | region.devMinor;
+}
+
+// The fields every part of a mapping has in common.
+VSRegionInfo commonRecord(const SmapsRegion &region, uint32_t userTag) {
     VSRegionInfo info;
     info.protection = (region.read ? kProtRead : 0) | (region.write ? kProtWrite : 0) |
                       (region.exec ? kProtExecute : 0);
@@ -125,45 +131,140 @@ VSRegionInfo regionInfoFor(const SmapsRegion &region, MappingKind kind, uint32_t
     } else {
         info.inheritance = region.shared ? kInheritShare : kInheritCopy;
     }
-    // Anonymous memory is its own object, so it starts at offset 0 of it.
-    const bool fileLike = kind == MappingKind::File || kind == MappingKind::SharedMemory;
-    info.offset = fileLike ? region.offset : 0;
     info.userTag = userTag;
-    info.residentPages = pages(region.rss, pageSize);
-    info.swappedOutPages = pages(region.swap, pageSize);
-    info.dirtiedPages = pages(region.privateDirty + region.sharedDirty, pageSize);
-    info.reusablePages = pages(region.lazyFree, pageSize);
     info.referenceCount = 1;
-    info.externalPager = kind == MappingKind::File ? 1 : 0;
-    // The kernel's special mappings are the same pages in every process, so
-    // they are one shared object rather than a private copy per process.
-    if (region.shared || kind == MappingKind::Special) {
-        info.shareMode = kShareModeShared;
-    } else if (region.rss + region.swap == 0) {
-        info.shareMode = kShareModeEmpty;
-    } else if (kind == MappingKind::File || region.sharedClean + region.sharedDirty > 0) {
-        info.shareMode = kShareModeCopyOnWrite;
-    } else {
-        info.shareMode = kShareModePrivate;
-    }
+    return info;
+}
+
+struct PartPages {
+    uint64_t resident = 0;
+    uint64_t dirty = 0;
+    uint64_t swapped = 0;
+    uint64_t reusable = 0;
+};
+
+VSRegionInfo part(VSRegionInfo info, const SmapsRegion &region, uint32_t objectId, uint64_t offset,
+                  const PartPages &pages, bool droppable, uint8_t shareMode) {
     info.objectId = objectId;
-    // Locked is a proportional share; the region's own locked pages are
-    // all its resident pages.
+    info.offset = offset;
+    info.residentPages = pagesOf(pages.resident);
+    info.dirtiedPages = pagesOf(std::min(pages.dirty, pages.resident));
+    info.swappedOutPages = pagesOf(pages.swapped);
+    info.reusablePages = pagesOf(std::min(pages.reusable, pages.resident));
+    info.externalPager = droppable ? 1 : 0;
+    info.shareMode = pages.resident + pages.swapped == 0 ? kShareModeEmpty : shareMode;
+    // Locked is a proportional share; the part's own locked pages are all
+    // its resident pages.
     if (region.hasFlag(kVmLocked)) {
-        info.userWiredCount = static_cast<uint16_t>(std::min<uint64_t>(region.rss / pageSize, 0xFFFF));
+        info.userWiredCount = static_cast<uint16_t>(std::min<uint64_t>(pages.resident, 0xFFFF));
     }
     return info;
 }
 
+uint64_t clampedDifference(uint64_t a, uint64_t b) {
+    return a > b ? a - b : 0;
+}
+
+} // namespace
+
+std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind kind, uint32_t userTag,
+                                         ObjectIdTable &ids, uint64_t pageSize,
+                                         const std::vector<SharedAnonymousPart> &shared,
+                                         const std::optional<ObjectPages> &objectPages) {
+    const VSRegionInfo common = commonRecord(region, userTag);
+    const auto pages = [pageSize](uint64_t bytes) { return bytes / pageSize; };
+    std::vector<VSRegionInfo> parts;
+
+    if (region.hasFlag(kVmHugetlb)) {
+        // Hugetlb pages cannot be dropped or swapped; Rss leaves them out.
+        const uint64_t resident = pages(region.privateHugetlb + region.sharedHugetlb);
+        const uint32_t id = region.shared && region.inode != 0 ? ids.idForFile(deviceOf(region), region.inode)
+                                                               : ids.freshId();
+        parts.push_back(part(common, region, id, region.shared ? region.offset : 0, {resident, resident, 0, 0},
+                             false, region.shared ? kShareModeShared : kShareModePrivate));
+        return parts;
+    }
+    if (kind == MappingKind::Special) {
+        // The same kernel pages in every process: one shared object.
+        const uint64_t resident = pages(region.rss);
+        parts.push_back(part(common, region, ids.idForName(region.path), 0,
+                             {resident, pages(region.privateDirty + region.sharedDirty), 0, 0}, false,
+                             kShareModeShared));
+        return parts;
+    }
+    const bool fileLike = kind == MappingKind::File || kind == MappingKind::SharedMemory;
+    const bool droppable = kind == MappingKind::File;
+    if (region.shared) {
+        // Every page of a shared mapping is the object's own page.
+        const uint32_t id = region.inode != 0 ? ids.idForFile(deviceOf(region), region.inode) : ids.freshId();
+        PartPages counts{pages(region.rss), pages(region.privateDirty + region.sharedDirty), pages(region.swap),
+                         pages(region.lazyFree)};
+        if (objectPages) {
+            counts.resident = objectPages->residentPages;
+            counts.dirty = objectPages->dirtyPages;
+        }
+        parts.push_back(part(common, region, id, fileLike ? region.offset : 0, counts, droppable, kShareModeShared));
+        return parts;
+    }
+
+    // A private mapping: page cache pages of its file, copies of its own,
+    // and anonymous pages it shares with other targets.
+    const uint64_t resident = pages(region.rss);
+    const bool hasFile = fileLike && region.inode != 0;
+    // Without a file every resident page is anonymous.
+    const uint64_t anonymous = hasFile ? std::min(pages(region.anonymous), resident) : resident;
+    const uint64_t lazyFree = pages(region.lazyFree);
+    uint64_t sharedPresent = 0;
+    uint64_t sharedSwapped = 0;
+    for (const SharedAnonymousPart &set : shared) {
+        sharedPresent += set.presentPages;
+        sharedSwapped += set.swappedPages;
+    }
+    // pagemap and smaps are two looks at a changing process: the shared
+    // parts come from the frames, the rest stays the mapping's own.
+    const uint64_t ownPresent = clampedDifference(anonymous, sharedPresent);
+    const uint64_t ownSwapped = clampedDifference(pages(region.swap), sharedSwapped);
+    if (hasFile) {
+        const uint64_t filePages = resident - anonymous;
+        // Dirty page cache (written with write()) belongs to the file; every
+        // anonymous page but a lazily freed one is dirty.
+        const uint64_t fileDirty =
+            clampedDifference(pages(region.privateDirty + region.sharedDirty), clampedDifference(anonymous, lazyFree));
+        const uint32_t id = ids.idForFileWindow(deviceOf(region), region.inode, region.offset);
+        if (filePages > 0 || ownPresent + ownSwapped + sharedPresent + sharedSwapped == 0) {
+            parts.push_back(part(common, region, id, region.offset, {filePages, fileDirty, 0, 0}, droppable,
+                                 kShareModeShared));
+        }
+    }
+    if (ownPresent + ownSwapped > 0 || (parts.empty() && sharedPresent + sharedSwapped == 0)) {
+        parts.push_back(part(common, region, ids.freshId(), 0,
+                             {ownPresent, clampedDifference(ownPresent, lazyFree), ownSwapped, lazyFree}, false,
+                             kShareModePrivate));
+    }
+    for (const SharedAnonymousPart &set : shared) {
+        if (set.presentPages + set.swappedPages == 0) {
+            continue;
+        }
+        // Shared copies sit at the same address in every process of a fork
+        // family: the address places them in the set's object, so each
+        // frame counts once however many members map it.
+        parts.push_back(part(common, region, set.objectId, region.start,
+                             {set.presentPages, set.presentPages, set.swappedPages, 0}, false, kShareModeShared));
+    }
+    return parts;
+}
+
 VSRegionBasicInfo basicInfoFor(const SmapsRegion &region, MappingKind kind, uint64_t pageSize) {
-    const VSRegionInfo full = regionInfoFor(region, kind, 0, 0, pageSize);
+    const VSRegionInfo common = commonRecord(region, 0);
     VSRegionBasicInfo basic;
-    basic.protection = full.protection;
-    basic.maxProtection = full.maxProtection;
-    basic.inheritance = full.inheritance;
+    basic.protection = common.protection;
+    basic.maxProtection = common.maxProtection;
+    basic.inheritance = common.inheritance;
     basic.shared = region.shared ? 1 : 0;
-    basic.offset = full.offset;
-    basic.userWiredCount = full.userWiredCount;
+    basic.offset = kind == MappingKind::File || kind == MappingKind::SharedMemory ? region.offset : 0;
+    if (region.hasFlag(kVmLocked)) {
+        basic.userWiredCount = static_cast<uint16_t>(std::min<uint64_t>(region.rss / pageSize, 0xFFFF));
+    }
     return basic;
 }
 

@@ -9,6 +9,7 @@
 #include "targets/platform/platform.h"
 
 #include <cstdint>
+#include <optional>
 #include <vector>
 
 namespace vs {
@@ -20,13 +21,39 @@ class ObjectIdTable;
 uint32_t userTagFor(const SmapsRegion &region, MappingKind kind,
                     const std::vector<uint64_t> &stackPointers);
 
-// The object id of a mapping: per (device, inode) for files and shmem, per
-// name for the kernel's special mappings, fresh for anonymous memory.
-uint32_t objectIdFor(const SmapsRegion &region, MappingKind kind, ObjectIdTable &ids);
+// Anonymous pages of a private mapping that other targets map too (after
+// fork, or merged by KSM): one set of targets' share of the mapping.
+struct SharedAnonymousPart {
+    uint32_t objectId = 0;   // the set's object at this address
+    uint64_t presentPages = 0;
+    uint64_t swappedPages = 0;
+};
 
-// The full record (counts in pages of `pageSize`).
-VSRegionInfo regionInfoFor(const SmapsRegion &region, MappingKind kind, uint32_t userTag,
-                           uint32_t objectId, uint64_t pageSize);
+// The whole object's pages within a shared mapping's range, where several
+// mappings of the object hold different pages (the union of what they
+// have resident), replacing the mapping's own counts.
+struct ObjectPages {
+    uint64_t residentPages = 0;
+    uint64_t dirtyPages = 0;
+};
+
+// Does the mapping hold anonymous pages that may be mapped by other
+// processes too? Only such mappings need their frames looked up.
+bool mayShareAnonymousPages(const SmapsRegion &region, MappingKind kind);
+
+// The records of a mapping, one per part, each in exactly one memory object
+// (counts in pages of `pageSize`):
+//   - file pages (Rss - Anonymous of a file or shmem mapping, page cache
+//     dirtied by write() included): the file's object at its file offsets
+//     (for a private mapping, the window of the file it shows);
+//   - anonymous pages this process alone maps: the mapping's own object;
+//   - anonymous pages shared with other targets: one part per set (`shared`).
+// A mapping with nothing resident or swapped is one empty part. Hugetlb
+// pages, which Rss leaves out, count as resident and dirty.
+std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind kind, uint32_t userTag,
+                                         ObjectIdTable &ids, uint64_t pageSize,
+                                         const std::vector<SharedAnonymousPart> &shared = {},
+                                         const std::optional<ObjectPages> &objectPages = std::nullopt);
 
 // The top-level record of the same mapping.
 VSRegionBasicInfo basicInfoFor(const SmapsRegion &region, MappingKind kind, uint64_t pageSize);

@@ -157,6 +157,10 @@ void parseField(const char *line, const char *lineEnd, SmapsRegion &r) {
             r.sharedDirty = value(13);
         } else if (hasName(line, lineEnd, "Swap:")) {
             r.swap = value(5);
+        } else if (hasName(line, lineEnd, "SwapPss:")) {
+            r.swapPss = value(8);
+        } else if (hasName(line, lineEnd, "Shared_Hugetlb:")) {
+            r.sharedHugetlb = value(15);
         }
         break;
     case 'P':
@@ -164,6 +168,13 @@ void parseField(const char *line, const char *lineEnd, SmapsRegion &r) {
             r.privateClean = value(14);
         } else if (hasName(line, lineEnd, "Private_Dirty:")) {
             r.privateDirty = value(14);
+        } else if (hasName(line, lineEnd, "Private_Hugetlb:")) {
+            r.privateHugetlb = value(16);
+        }
+        break;
+    case 'A':
+        if (hasName(line, lineEnd, "Anonymous:")) {
+            r.anonymous = value(10);
         }
         break;
     case 'L':

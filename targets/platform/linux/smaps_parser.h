@@ -73,7 +73,11 @@ struct SmapsRegion {
     uint64_t privateClean = 0;
     uint64_t privateDirty = 0;
     uint64_t lazyFree = 0;
+    uint64_t anonymous = 0; // anonymous pages, copy-on-write copies of file pages included
     uint64_t swap = 0;
+    uint64_t swapPss = 0;   // below swap when some swap entries are shared
+    uint64_t privateHugetlb = 0; // hugetlb pages, which Rss leaves out
+    uint64_t sharedHugetlb = 0;
     uint64_t locked = 0;
     uint64_t vmFlags = 0;
     bool hasVmFlags = false; // false for maps lines and cut-short records

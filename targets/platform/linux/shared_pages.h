@@ -1,0 +1,93 @@
+#pragma once
+
+// What the targets of one run share page by page, which no single
+// process's smaps can tell:
+//   - anonymous pages mapped by several targets (copy-on-write after fork,
+//     KSM), found by frame number or swap entry: each such page belongs to
+//     the exact set of targets that map it, interned as a small set id;
+//   - the pages of a shared file or shmem object that several mappings
+//     touch in different parts: the union of the pages any of them has
+//     resident, by file page.
+// Targets add what they map (from several threads) before any target is
+// walked; the walk then only looks up. The index holds one entry per page
+// that may be shared, never one per process and page.
+
+#include <cstdint>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <span>
+#include <unordered_map>
+#include <utility>
+#include <vector>
+
+namespace vs {
+
+// Swapped pages are keyed by their swap entry with this bit set, so that
+// they never meet a frame number (frame numbers have at most 55 bits).
+inline constexpr uint64_t kSwapKey = 1ull << 63;
+
+class SharedPageIndex {
+public:
+    // The pages of a target that other targets may map too (keys as
+    // above). A target may add in several calls.
+    void addPages(int32_t pid, std::span<const uint64_t> keys);
+
+    // The set of targets mapping the page when it has more than one
+    // member; nullopt for a page one target alone maps.
+    std::optional<uint32_t> sharedSet(uint64_t key) const;
+    // The same for many keys under one lock: `sets` gets, per key, its set
+    // or kNoSet.
+    static constexpr uint32_t kNoSet = UINT32_MAX;
+    void sharedSets(std::span<const uint64_t> keys, std::vector<uint32_t> &sets) const;
+    // The pids of a set, sorted.
+    std::vector<int32_t> setMembers(uint32_t set) const;
+
+    // The pages a mapping of an object holds, one bit per page from file
+    // page `firstPage` on (`present` empty: every page of `pageCount`);
+    // `dirty` empty when the dirty state is unknown, with `dirtyCount`
+    // the mapping's own count of dirty pages instead.
+    struct Window {
+        uint64_t device = 0;
+        uint64_t inode = 0;
+        uint64_t firstPage = 0;
+        uint64_t pageCount = 0;
+        std::vector<uint64_t> present;
+        std::vector<uint64_t> dirty;
+        uint64_t dirtyCount = 0;
+    };
+    void addWindow(const Window &window);
+
+    // The object's pages within [firstPage, firstPage + pageCount): how
+    // many any mapping holds and how many of those are dirty. nullopt when
+    // one mapping alone maps the object (its own counts are exact).
+    struct Pages {
+        uint64_t resident = 0;
+        uint64_t dirty = 0;
+    };
+    std::optional<Pages> objectPages(uint64_t device, uint64_t inode, uint64_t firstPage,
+                                     uint64_t pageCount) const;
+
+    void clear();
+
+private:
+    struct ObjectBits {
+        uint32_t mappings = 0;
+        std::vector<uint64_t> present; // by file page
+        std::vector<uint64_t> dirty;
+        uint64_t unknownDirty = 0; // the most dirty pages one mapping of unknown state had
+    };
+
+    uint32_t _internSet(std::vector<int32_t> members);
+    uint32_t _setWith(uint32_t set, int32_t pid);
+
+    mutable std::mutex _mutex;
+    // Set 0 is the empty set; a page's entry names the targets seen so far.
+    std::vector<std::vector<int32_t>> _sets{{}};
+    std::map<std::vector<int32_t>, uint32_t> _setIds{{{}, 0}};
+    std::unordered_map<uint64_t, uint32_t> _transitions; // (set << 32 | pid) -> set
+    std::unordered_map<uint64_t, uint32_t> _pages;       // key -> set
+    std::map<std::pair<uint64_t, uint64_t>, ObjectBits> _objects;
+};
+
+} // namespace vs
