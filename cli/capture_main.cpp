@@ -72,10 +72,10 @@ int main(int argc, char **argv) {
 
     VSLinuxPlatform platform;
     VSPlatform::setCurrent(&platform);
-    const vs::HeapfileCapture capture(
-        [&platform](VSTaskHandle task) { return vs::linuxRegionIdentities(platform, task); });
+    const vs::HeapfileCapture capture(vs::linuxObjectIdentity);
 
     int status = 0;
+    std::vector<int32_t> pids;
     for (int index = optind; index < argc; ++index) {
         int32_t pid = 0;
         if (!parsePid(argv[index], pid)) {
@@ -83,8 +83,14 @@ int main(int argc, char **argv) {
             status = 1;
             continue;
         }
-        vs::HeapfileError error;
-        const std::optional<VSHeapfileSnapshot> snapshot = capture.capture(pid, &error);
+        pids.push_back(pid);
+    }
+    // Captured together: what a fork family shares stays shared.
+    std::vector<vs::HeapfileCapture::Captured> captured = capture.captureTogether(pids);
+    for (size_t index = 0; index < pids.size(); ++index) {
+        const int32_t pid = pids[index];
+        vs::HeapfileError error = captured[index].error;
+        const std::optional<VSHeapfileSnapshot> &snapshot = captured[index].snapshot;
         if (!snapshot) {
             std::fprintf(stderr, "vestage-capture: cannot capture %s\n", error.description.c_str());
             status = 1;

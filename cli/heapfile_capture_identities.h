@@ -1,22 +1,17 @@
 #pragma once
 
-// Stable identities of the regions of a Linux task, for heapfile captures:
-// a file mapping is its device, inode and offset, a kernel-provided mapping
-// (vdso, vvar, vsyscall) its name and offset. Heapfiles captured at
-// different times then still share what live processes share. Anonymous
-// memory has no identity beyond its process and is left out.
+// Stable identities of the Linux layer's memory objects, for heapfile
+// captures: a file is its device and inode (a private mapping's window of
+// it adds the offset), a kernel-provided mapping (vdso, vvar, vsyscall) its
+// name. Heapfiles captured at different times then still share what live
+// processes share. Anonymous memory has no identity beyond its run.
 
 #include <cstdint>
-#include <map>
+#include <optional>
 #include <string>
-
-#include "targets/platform/platform.h"
-
-class VSLinuxPlatform;
 
 namespace vs {
 
-// By region start; empty when the task's regions cannot be read.
-std::map<uint64_t, std::string> linuxRegionIdentities(VSLinuxPlatform &platform, VSTaskHandle task);
+std::optional<std::string> linuxObjectIdentity(uint32_t objectId);
 
 }  // namespace vs

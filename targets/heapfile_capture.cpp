@@ -127,61 +127,38 @@ HeapfileCapture::HeapfileCapture(RegionIdentityProvider identities, std::optiona
     }
 }
 
-std::optional<VSHeapfileSnapshot> HeapfileCapture::capture(int32_t pid, HeapfileError *error) const {
-    auto fail = [&](const std::string &reason) {
-        if (error != nullptr) {
-            *error = captureError(pid, reason);
-        }
-        return std::nullopt;
-    };
-    VSPlatform &platform = VSPlatform::current();
-    VSBsdInfo bsdInfo;
-    if (platform.pid_bsd_info(pid, bsdInfo) != static_cast<int32_t>(sizeof(VSBsdInfo))) {
-        return fail("no such process, or not permitted to see it");
-    }
-    if ((bsdInfo.flags & kBsdInfoFlagSystem) != 0) {
-        return fail("the kernel cannot be captured");
-    }
-    auto process = std::make_unique<VSCapturingProcess>();
-    if (!process->setUp(bsdInfo)) {
-        return fail(process->taskError().value_or("cannot be opened"));
-    }
-    if (process->sharedRegionSize() != 0) {
-        return fail("has a shared cache region, which a heapfile capture cannot record");
-    }
-    const uint64_t page = process->pageSize();
-    if (page == 0 || (page & (page - 1)) != 0 || page > UINT32_MAX) {
-        return fail("unusable page size " + std::to_string(page));
-    }
+namespace {
 
-    process->gatherData();
+// Walks a process opened (and prepared) for capture into its snapshot.
+std::optional<VSHeapfileSnapshot> snapshotOf(VSCapturingProcess &process, const RegionIdentityProvider &identities,
+                                             uint64_t sessionSalt, HeapfileError &error) {
+    const uint64_t page = process.pageSize();
+    process.gatherData();
     // A partial address space would pass for a whole one later.
-    if (!process->errors().empty()) {
-        return fail(process->errors().front());
+    if (!process.errors().empty()) {
+        error = captureError(process.pid(), process.errors().front());
+        return std::nullopt;
     }
-    if (!process->warnings().empty()) {
-        return fail(process->warnings().front());
+    if (!process.warnings().empty()) {
+        error = captureError(process.pid(), process.warnings().front());
+        return std::nullopt;
     }
 
     VSHeapfileSnapshot snapshot;
-    snapshot.pid = process->pid();
-    snapshot.name = process->name();
-    snapshot.is64bit = process->is64bit();
+    snapshot.pid = process.pid();
+    snapshot.name = process.name();
+    snapshot.is64bit = process.is64bit();
     snapshot.description = std::string(architectureName(snapshot.is64bit)) + " process " + snapshot.name + " [" +
                            std::to_string(snapshot.pid) + "], no shared region";
     snapshot.pageSize = static_cast<uint32_t>(page);
-    snapshot.physVestage = process->phys_vestage();
-    snapshot.physVestagePeak = process->phys_vestage_peak();
-    snapshot.breakDownPhysVestage = process->breakDownDuringWalk();
+    snapshot.physVestage = process.phys_vestage();
+    snapshot.physVestagePeak = process.phys_vestage_peak();
+    snapshot.breakDownPhysVestage = process.breakDownDuringWalk();
 
-    std::map<uint64_t, std::string> identities;
-    if (_identities) {
-        identities = _identities(process->task());
-    }
-    const std::string salt = std::to_string(_salt);
-    const bool recalculate = process->anonymousDirtyRecalculation() && !snapshot.breakDownPhysVestage;
+    const std::string salt = std::to_string(sessionSalt);
+    const bool recalculate = process.anonymousDirtyRecalculation() && !snapshot.breakDownPhysVestage;
 
-    for (const VSCapturingProcess::WalkedRegion &walked : process->walked()) {
+    for (const VSCapturingProcess::WalkedRegion &walked : process.walked()) {
         const VSRegionInfo &info = walked.info;
         VSHeapfileRegion region;
         region.address = walked.start;
@@ -225,18 +202,77 @@ std::optional<VSHeapfileSnapshot> HeapfileCapture::capture(int32_t pid, Heapfile
         region.shareMode = info.shareMode;
         region.submap = info.isSubmap != 0 ? 1 : 0;
         region.purgeableState = walked.purgeableState;
+        region.offset = info.offset;
         if (info.objectId != 0) {
-            const auto identity = identities.find(walked.start);
-            if (identity != identities.end()) {
-                region.objectId = objectIdForIdentity(identity->second);
-            } else {
-                region.objectId = objectIdForIdentity("session " + salt + " object " + std::to_string(info.objectId) +
-                                                      " offset " + std::to_string(info.offset));
+            std::optional<std::string> identity;
+            if (identities) {
+                identity = identities(info.objectId);
             }
+            // Memory known only to this run is the session's: processes
+            // captured together share it as they did live.
+            region.objectId = objectIdForIdentity(
+                identity ? *identity : "session " + salt + " object " + std::to_string(info.objectId));
         }
         snapshot.regions.push_back(std::move(region));
     }
     return snapshot;
+}
+
+}  // namespace
+
+std::optional<VSHeapfileSnapshot> HeapfileCapture::capture(int32_t pid, HeapfileError *error) const {
+    std::vector<Captured> captured = captureTogether({pid});
+    if (!captured[0].snapshot && error != nullptr) {
+        *error = captured[0].error;
+    }
+    return std::move(captured[0].snapshot);
+}
+
+std::vector<HeapfileCapture::Captured> HeapfileCapture::captureTogether(const std::vector<int32_t> &pids) const {
+    VSPlatform &platform = VSPlatform::current();
+    std::vector<Captured> results(pids.size());
+    std::vector<std::unique_ptr<VSCapturingProcess>> processes(pids.size());
+    // Every process is opened and prepared before any is walked, so that
+    // the pages they share are known to be shared in each snapshot.
+    bool waits = false;
+    for (size_t i = 0; i < pids.size(); ++i) {
+        const int32_t pid = pids[i];
+        auto fail = [&](const std::string &reason) { results[i].error = captureError(pid, reason); };
+        VSBsdInfo bsdInfo;
+        if (platform.pid_bsd_info(pid, bsdInfo) != static_cast<int32_t>(sizeof(VSBsdInfo))) {
+            fail("no such process, or not permitted to see it");
+            continue;
+        }
+        if ((bsdInfo.flags & kBsdInfoFlagSystem) != 0) {
+            fail("the kernel cannot be captured");
+            continue;
+        }
+        auto process = std::make_unique<VSCapturingProcess>();
+        if (!process->setUp(bsdInfo)) {
+            fail(process->taskError().value_or("cannot be opened"));
+            continue;
+        }
+        if (process->sharedRegionSize() != 0) {
+            fail("has a shared cache region, which a heapfile capture cannot record");
+            continue;
+        }
+        const uint64_t page = process->pageSize();
+        if (page == 0 || (page & (page - 1)) != 0 || page > UINT32_MAX) {
+            fail("unusable page size " + std::to_string(page));
+            continue;
+        }
+        waits = process->prepareGatherData() || waits;
+        processes[i] = std::move(process);
+    }
+    if (waits) {
+        platform.resolve_shared_pages();
+    }
+    for (size_t i = 0; i < pids.size(); ++i) {
+        if (processes[i]) {
+            results[i].snapshot = snapshotOf(*processes[i], _identities, _salt, results[i].error);
+        }
+    }
+    return results;
 }
 
 std::string heapfileFileName(const VSHeapfileSnapshot &snapshot) {

@@ -9,21 +9,21 @@
 // - user-wired pages (the heapfile walk sets no wired count);
 // - reusable pages (given back with MADV_FREE): they read as clean instead
 //   of reclaimable;
-// - mapping offsets: the heapfile walk places every region of an object at
-//   offset 0, so each distinct (object, offset) pair is written as an
-//   object of its own. Regions of one object that overlap at different
-//   offsets are then no longer de-duplicated against each other.
 // Anonymous memory is written with the dirty bytes the live walk counts
 // (all resident pages but the reusable ones), because the heapfile walk
 // takes the recorded dirty bytes as they are.
 //
+// A mapping that holds pages of several objects is written as one region
+// per part, each repeating the mapping's address and length.
+//
 // Object ids. Live ids are numbers of one run. A heapfile's ids are 32-bit
-// hashes: of the region's stable identity (file device, inode and offset;
-// a special kernel mapping's name) when the identity provider knows it, so
-// that separately captured heapfiles share a library as live processes
-// do; otherwise of the live id, the offset and a salt drawn once per
-// capture session, so that processes captured together share what they
-// share live and never meet the private memory of another session.
+// hashes: of the object's stable identity (a file's device and inode, with
+// the offset of a private mapping's window; a special kernel mapping's
+// name) when the identity provider knows it, so that separately captured
+// heapfiles share a library as live processes do; otherwise of the live id
+// and a salt drawn once per capture session, so that processes captured
+// together share what they share live and never meet the private memory
+// of another session. Each region keeps its offset in its object.
 // Hash collisions are possible but rare (a few thousand objects in 2^32).
 
 #include <cstdint>
@@ -31,15 +31,16 @@
 #include <map>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "targets/heapfile_format.h"
 #include "targets/platform/platform.h"
 
 namespace vs {
 
-// Stable identities of a task's regions, by region start. Regions it
-// leaves out are private to their process.
-using RegionIdentityProvider = std::function<std::map<uint64_t, std::string>(VSTaskHandle task)>;
+// The stable identity of a live object id (see above), or nullopt for
+// memory known only to this run.
+using RegionIdentityProvider = std::function<std::optional<std::string>(uint32_t objectId)>;
 
 class HeapfileCapture {
 public:
@@ -51,6 +52,15 @@ public:
     // opened or read, or has a shared cache region (which a capture cannot
     // record).
     std::optional<VSHeapfileSnapshot> capture(int32_t pid, HeapfileError *error) const;
+
+    // Several processes captured together: anonymous pages they share (a
+    // fork family) stay shared between their snapshots, counted once when
+    // the heapfiles are analysed together. One result per pid, in order.
+    struct Captured {
+        std::optional<VSHeapfileSnapshot> snapshot;
+        HeapfileError error;
+    };
+    std::vector<Captured> captureTogether(const std::vector<int32_t> &pids) const;
 
 private:
     RegionIdentityProvider _identities;

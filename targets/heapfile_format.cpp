@@ -335,6 +335,9 @@ std::optional<VSHeapfileRegion> readRegion(const json &object, size_t index, vs:
     region.shareMode = static_cast<uint8_t>(fields.unsignedValue("shareMode", UINT8_MAX).value_or(0));
     region.submap = fields.flag("submap").value_or(false) ? 1 : 0;
     region.objectId = fields.unsignedValue("objectId", kMax64).value_or(0);
+    if (object.contains("offset")) {
+        region.offset = fields.unsignedValue("offset", kMax64).value_or(0);
+    }
     region.purgeableState = static_cast<int32_t>(fields.unsignedValue("purgeableState", 3).value_or(3));
     if (fields.failed()) {
         return std::nullopt;
@@ -422,7 +425,8 @@ std::optional<VSHeapfileSnapshot> parseHeapfile(std::string_view bytes, Heapfile
         setError(error, kHeapfileErrorMissingKey, "missing key \"version\"");
         return std::nullopt;
     }
-    if (!version->is_number_integer() || version->get<int64_t>() != kHeapfileVersion) {
+    if (!version->is_number_integer() || version->get<int64_t>() < kOldestHeapfileVersion ||
+        version->get<int64_t>() > kHeapfileVersion) {
         setError(error, kHeapfileErrorVersion,
                  "heapfile version " + version->dump() + " is not supported (this vestage reads version " +
                      std::to_string(kHeapfileVersion) + ")");
@@ -471,8 +475,11 @@ std::optional<VSHeapfileSnapshot> parseHeapfile(std::string_view bytes, Heapfile
         if (!region) {
             return std::nullopt;
         }
-        // The walk and the image lookup both depend on ascending order.
-        if (!snapshot.regions.empty() && region->address < snapshot.regions.back().end()) {
+        // The walk and the image lookup both depend on ascending order; a
+        // mapping's parts repeat its range one after the other.
+        const bool part = !snapshot.regions.empty() && region->address == snapshot.regions.back().address &&
+                          region->length == snapshot.regions.back().length;
+        if (!snapshot.regions.empty() && !part && region->address < snapshot.regions.back().end()) {
             setError(error, kHeapfileErrorInconsistent,
                      "region " + std::to_string(index) + " (" + hex(region->address) +
                          ") starts before the end of region " + std::to_string(index - 1) + " (" +
@@ -538,6 +545,9 @@ std::string heapfileText(const VSHeapfileSnapshot &snapshot) {
         object["shareMode"] = region.shareMode;
         object["submap"] = (region.submap & 1) != 0;
         object["objectId"] = region.objectId;
+        if (region.offset != 0) {
+            object["offset"] = region.offset;
+        }
         object["purgeableState"] = region.purgeableState;
         out += index == 0 ? "\n    " : ",\n    ";
         out += jsonText(object);

@@ -29,7 +29,10 @@ namespace vs {
 // The value of the "format" key of every heapfile.
 inline constexpr std::string_view kHeapfileFormatName = "vestage-heapfile";
 // The only version this build reads and writes.
-inline constexpr int64_t kHeapfileVersion = 1;
+inline constexpr int64_t kHeapfileVersion = 2;
+// Version 1 had no region offsets and one region per mapping; it is read
+// as it stands.
+inline constexpr int64_t kOldestHeapfileVersion = 1;
 
 // Error domains. Errors this program makes itself (a reader that could not
 // be opened, an unknown platform) carry the program's own domain; a file
@@ -84,6 +87,7 @@ struct VSHeapfileRegion {
     uint8_t submap = 0;  // the lowest bit counts
     uint64_t objectId = 0;  // the walk uses the low 32 bits
     int32_t purgeableState = 3;  // VSPurgeableState
+    uint64_t offset = 0;    // where the region lies in its object
 
     uint64_t end() const { return address + length; }
     bool operator==(const VSHeapfileRegion &) const = default;

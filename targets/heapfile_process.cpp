@@ -132,6 +132,7 @@ VSRegionInfo VSHeapfileProcess::_regionInfoForHeapfileRegion(const VSHeapfileReg
     info.shareMode = region.shareMode;
     info.isSubmap = region.submap & 1;
     info.objectId = static_cast<uint32_t>(region.objectId);
+    info.offset = region.offset;
     return info;
 }
 
@@ -157,7 +158,10 @@ void VSHeapfileProcess::enumerateRegions(const RegionCallback &callback) {
             _images.push_back(std::move(*scratch));
             scratch.reset();
         }
-        const std::optional<std::string> path = region.externalPager != 0 ? region.path : std::nullopt;
+        // A file's pages show its path; so do the copies a private mapping
+        // made of them, which the capture wrote as a mapped file too.
+        const bool showsPath = region.externalPager != 0 || region.type == "mapped file";
+        const std::optional<std::string> path = showsPath ? region.path : std::nullopt;
         stop = callback(region.address, region.length, info, region.purgeableState, path);
     });
 }

@@ -42,7 +42,8 @@ TEST(HeapfileFormatTest, BadFilesAreRefusedWithTheirProblemNamed) {
         {std::string(10000, '[') + std::string(10000, ']'), kHeapfileErrorNotHeapfile, "nested"},
         {without("/format"), kHeapfileErrorNotHeapfile, "no \"format\""},
         {with("/format", "other-snapshot"), kHeapfileErrorNotHeapfile, "\"other-snapshot\""},
-        {with("/version", 2), kHeapfileErrorVersion, "version 2 is not supported"},
+        {with("/version", 3), kHeapfileErrorVersion, "version 3 is not supported"},
+        {with("/version", 0), kHeapfileErrorVersion, "version 0 is not supported"},
         {without("/pid"), kHeapfileErrorMissingKey, "missing key \"pid\""},
         {with("/pid", -3), kHeapfileErrorBadValue, "\"pid\" is negative"},
         {with("/pid", 4294967296ull), kHeapfileErrorBadValue, "above its limit"},
@@ -60,6 +61,14 @@ TEST(HeapfileFormatTest, BadFilesAreRefusedWithTheirProblemNamed) {
         {with("/regions/1/address", "0x401000"), kHeapfileErrorInconsistent,
          "region 1 (0x401000) starts before the end of region 0 (0x402000)"},
         {with("/regions/0/purgeableState", 7), kHeapfileErrorBadValue, "\"purgeableState\" is 7"},
+        // A part repeats its mapping's whole range, nothing less.
+        {with("/regions/1", json{{"address", "0x400000"}, {"length", "0x1000"}, {"type", "x"}, {"protection", 0},
+                                 {"maxProtection", 0}, {"userTag", 0}, {"residentBytes", 0},
+                                 {"sharedNowPrivateBytes", 0}, {"swappedBytes", 0}, {"dirtyBytes", 0},
+                                 {"referenceCount", 0}, {"externalPager", false}, {"shareMode", 3},
+                                 {"submap", false}, {"objectId", 0}, {"purgeableState", 3}}),
+         kHeapfileErrorInconsistent, "region 1 (0x400000) starts before the end of region 0 (0x402000)"},
+        {with("/regions/0/offset", -1), kHeapfileErrorBadValue, "\"offset\" is negative"},
     };
     for (const auto &[text, code, mentions] : cases) {
         SCOPED_TRACE(mentions);
@@ -99,8 +108,20 @@ TEST(HeapfileFormatTest, WrittenTextReadsBackUnchanged) {
     snapshot.physVestage = 123456789012ull;
     snapshot.physVestagePeak = 223456789012ull;
     snapshot.breakDownPhysVestage = true;
+    // The parts of one mapping: the same range, each in its object at its offset.
+    VSHeapfileRegion part = low;
+    part.objectId = 77;
+    part.offset = 0x7f0000001000ull;
+    snapshot.regions.insert(snapshot.regions.begin() + 1, part);
     vs::HeapfileError error;
     EXPECT_EQ(vs::parseHeapfile(vs::heapfileText(snapshot), &error), snapshot) << error.description;
+    // A file from before offsets and parts reads as it stands.
+    json old = json::parse(vs::heapfileText(snapshot));
+    old["version"] = 1;
+    old["regions"].erase(1);
+    old["regions"][0].erase("offset");
+    snapshot.regions.erase(snapshot.regions.begin() + 1);
+    EXPECT_EQ(vs::parseHeapfile(old.dump(), &error), snapshot) << error.description;
     snapshot.regions.clear();
     EXPECT_EQ(vs::parseHeapfile(vs::heapfileText(snapshot), &error), snapshot) << error.description;
 }

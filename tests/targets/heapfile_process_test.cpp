@@ -176,8 +176,9 @@ TEST_F(HeapfileProcessTest, CapturedObjectIdsShareWithinASessionOnly) {
     const auto a = session.capture(300, nullptr), b = session.capture(301, nullptr);
     const auto c = otherSession.capture(301, nullptr);
     ASSERT_TRUE(a && b && c);
-    // One object at two offsets is two objects: the heapfile walk puts every region of an object at offset 0.
-    EXPECT_NE(a->regions[0].objectId, a->regions[1].objectId);
+    // One object at two offsets stays one object, each region at its offset in it.
+    EXPECT_EQ(a->regions[0].objectId, a->regions[1].objectId);
+    EXPECT_EQ(std::make_pair(a->regions[0].offset, a->regions[1].offset), std::make_pair(uint64_t{0}, uint64_t{0x2000}));
     for (size_t i = 0; i < 3; ++i) {
         EXPECT_EQ(a->regions[i].objectId, b->regions[i].objectId) << i;  // the same object, the same id
         EXPECT_NE(b->regions[i].objectId, c->regions[i].objectId) << i;  // another session never meets it
