@@ -73,6 +73,88 @@ TEST(LiveRun, PrivateAndSharedMemoryOfAParentAndItsChild) {
     EXPECT_EQ(std::stoull(run.out.substr(run.out.rfind('\n', lastTotal) + 1)), dirty);
 }
 
+// Fork families as servers and worker pools make them: what the parent
+// wrote counts once however many children map it, what a child wrote is
+// its own, and a shared region written in parts is as large as all parts.
+TEST(LiveRun, ForkFamiliesCountEachPageOnce) {
+    if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";
+    constexpr uint64_t MiB = 1u << 20;
+    const uint64_t pages = 8 * MiB / kPage, tenth = pages / 10, quarter = pages / 4;
+    const std::string n = std::to_string(pages);
+    auto writes = [](const std::string &item, uint64_t first, uint64_t count) {
+        return item + ":" + std::to_string(first) + ":" + std::to_string(count);
+    };
+    struct Scene {
+        const char *what;
+        std::vector<std::string> items;
+        std::string category;
+        uint64_t summary;   // the category in the summary, to within 1 MiB
+        uint64_t childOwn;  // the category in each child's own table, to within 1 MiB
+    };
+    const std::string untagged = "untagged (\"VM_ALLOCATE\")";
+    const Scene scenes[] = {
+        {"children that only read", {"anon:a:" + n + ":" + n, "fork:c1", "fork:c2", "fork:c3"}, untagged, 8 * MiB, 0},
+        {"children that each write a tenth",
+         {"anon:a:" + n + ":" + n, writes("fork:c1:a", 0, tenth), writes("fork:c2:a", tenth, tenth),
+          writes("fork:c3:a", 2 * tenth, tenth)},
+         untagged, 8 * MiB + 3 * tenth * kPage, tenth * kPage},
+        {"a shared region written in quarters",
+         {"shared:s:" + n + ":0", writes("fork:c1:s", 0, quarter), writes("fork:c2:s", quarter, quarter),
+          writes("fork:c3:s", 2 * quarter, quarter), writes("fork:c4:s", 3 * quarter, quarter)},
+         "/dev/zero mapping", 8 * MiB, 0},
+    };
+    for (const Scene &scene : scenes) {
+        SCOPED_TRACE(scene.what);
+        MemChild parent(scene.items);
+        ASSERT_TRUE(parent.ready());
+        std::vector<std::string> args = {"-f", "bytes", "-p", std::to_string(parent.pid())};
+        std::vector<std::string> children;
+        for (const char *label : {"c1", "c2", "c3", "c4"}) {
+            if (!parent.fact(label, "pid").empty()) {
+                children.push_back("vs_memchild [" + parent.fact(label, "pid") + "]");
+                args.insert(args.end(), {"-p", parent.fact(label, "pid")});
+            }
+        }
+        const auto run = runProgram(args);
+        ASSERT_EQ(run.status, 0) << run.err;
+        const uint64_t summed = dirtyIn(run.out, "Summary Vestage", scene.category);
+        EXPECT_GE(summed, scene.summary) << run.out;
+        EXPECT_LT(summed, scene.summary + MiB) << run.out;
+        for (const std::string &child : children) {
+            const uint64_t own = dirtyIn(run.out, child + ": 64-bit", scene.category);
+            EXPECT_GE(own, scene.childOwn) << child << run.out;
+            EXPECT_LT(own, scene.childOwn + MiB) << child << run.out;
+        }
+    }
+}
+
+// Without the right to read page frames, pages shared after fork stay each
+// process's own, and the report says so once, in text and JSON alike.
+TEST(LiveRun, SharingAfterForkUnresolvedWithoutRootIsSaid) {
+    if (geteuid() != 0) GTEST_SKIP() << "the test drops to another user";
+    constexpr uid_t kNobody = 65534;
+    const std::string pages = std::to_string((8u << 20) / kPage);
+    MemChild parent({"anon:big:" + pages + ":" + pages, "fork:kid"}, VESTAGE_TEST_BIN_DIR "/vs_memchild", kNobody);
+    ASSERT_TRUE(parent.ready());
+    const std::string note =
+        "Pages shared after fork could not be told apart without the right to read page frames (run as root): "
+        "each process counts them as its own";
+    const std::string parentName = "vs_memchild [" + std::to_string(parent.pid()) + "]";
+    vs::test::ScratchDir dir;
+    ASSERT_EQ(chown(dir.path.c_str(), kNobody, kNobody), 0);
+    const auto run = runProgram({"-f", "bytes", "-p", std::to_string(parent.pid()), "--pid", parent.fact("kid", "pid"),
+                                 "--json", dir.path + "/report.json"},
+                                {.user = kNobody});
+    ASSERT_EQ(run.status, 0) << run.err;
+    EXPECT_NE(run.out.find("\nNotes:\n\t" + note + "\n"), std::string::npos) << run.out;
+    EXPECT_EQ(run.out.find("may be invalid"), std::string::npos) << "a note is no error: " << run.out;
+    EXPECT_GE(dirtyIn(run.out, parentName + ": 64-bit", "untagged (\"VM_ALLOCATE\")"), 8u << 20) << run.out;
+    std::ifstream in(dir.path + "/report.json");
+    const nlohmann::json document = nlohmann::json::parse(in, nullptr, false);
+    ASSERT_FALSE(document.is_discarded());
+    EXPECT_EQ(document.value("notes", nlohmann::json::array()), nlohmann::json::array({note}));
+}
+
 TEST(LiveRun, InterruptDuringGatheringStillReports) {
     if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
     // SIGINT pending from the start: met as soon as the program listens for it.

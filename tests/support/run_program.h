@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 #include <fcntl.h>
+#include <grp.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -31,7 +32,13 @@ struct RunSettings {
     // descriptor 3 (-1: descriptor 3 closed), standard streams closed.
     std::optional<int> descriptor3 = std::nullopt;
     bool closeOutputs = false, closeInput = false;
+    uid_t user = 0;  // run as this user (and its own group) when not 0
 };
+
+// Drops to an unprivileged user for the rest of a forked child's life.
+inline bool becomeUser(uid_t user) {
+    return user == 0 || (setgroups(0, nullptr) == 0 && setgid(user) == 0 && setuid(user) == 0);
+}
 
 // Runs a program (the built vestage by default) with argv[0] "vestage", named
 // by the option parser's diagnostics, in the C locale, on /dev/null.
@@ -69,7 +76,7 @@ inline RunResult runProgram(const std::vector<std::string> &args, const RunSetti
         // Nothing in the environment may change option parsing or its language.
         setenv("LC_ALL", "C", 1);
         unsetenv("POSIXLY_CORRECT");
-        if (s.workingDirectory.empty() || chdir(s.workingDirectory.c_str()) == 0) {
+        if (becomeUser(s.user) && (s.workingDirectory.empty() || chdir(s.workingDirectory.c_str()) == 0)) {
             execv(path.c_str(), argv.data());
         }
         _exit(127);
@@ -105,7 +112,7 @@ struct ScratchDir {
 class MemChild {
 public:
     explicit MemChild(const std::vector<std::string> &items,
-                      const std::string &program = VESTAGE_TEST_BIN_DIR "/vs_memchild") {
+                      const std::string &program = VESTAGE_TEST_BIN_DIR "/vs_memchild", uid_t user = 0) {
         std::vector<std::string> words{program};
         words.insert(words.end(), items.begin(), items.end());
         std::vector<char *> argv;
@@ -116,7 +123,7 @@ public:
         if ((_pid = fork()) == 0) {
             dup2(in[0], 0);
             dup2(out[1], 1);
-            execv(argv[0], argv.data());
+            if (becomeUser(user)) execv(argv[0], argv.data());
             _exit(127);
         }
         close(in[0]);

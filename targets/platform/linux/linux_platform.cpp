@@ -842,17 +842,24 @@ void VSLinuxPlatform::_buildParts(Task &task) {
                 keys.clear();
                 _candidateKeys(pagemap.get(), region, keys, nullptr);
                 _sharedPages.sharedSets(keys, sets);
+                // Counted by set first; a region meets few sets.
+                std::vector<std::pair<uint32_t, vs::SharedAnonymousPart>> bySet;
                 for (size_t k = 0; k < keys.size(); ++k) {
                     if (sets[k] == vs::SharedPageIndex::kNoSet) {
                         continue; // no other target maps it: the mapping's own
                     }
-                    const uint32_t objectId = ids.idForFrameSet(sets[k], region.start);
-                    auto set = std::find_if(shared.begin(), shared.end(),
-                                            [&](const vs::SharedAnonymousPart &p) { return p.objectId == objectId; });
-                    if (set == shared.end()) {
-                        set = shared.insert(shared.end(), vs::SharedAnonymousPart{objectId, 0, 0});
+                    auto set = bySet.begin();
+                    while (set != bySet.end() && set->first != sets[k]) {
+                        ++set;
                     }
-                    ((keys[k] & vs::kSwapKey) != 0 ? set->swappedPages : set->presentPages) += 1;
+                    if (set == bySet.end()) {
+                        set = bySet.insert(bySet.end(), {sets[k], vs::SharedAnonymousPart{}});
+                    }
+                    ((keys[k] & vs::kSwapKey) != 0 ? set->second.swappedPages : set->second.presentPages) += 1;
+                }
+                for (auto &[set, part] : bySet) {
+                    part.objectId = ids.idForFrameSet(set, region.start);
+                    shared.push_back(part);
                 }
             }
         } else if (resolved && _isSharedWindow(region, kind)) {

@@ -36,7 +36,71 @@ bool testBit(const std::vector<uint64_t> &bits, uint64_t index) {
     return index / 64 < bits.size() && (bits[index / 64] >> (index % 64) & 1) != 0;
 }
 
+size_t slotOf(uint64_t key, size_t mask) {
+    return static_cast<size_t>((key * 0x9E3779B97F4A7C15ull) >> 17) & mask;
+}
+
 } // namespace
+
+const uint32_t *SharedPageIndex::PageTable::find(uint64_t key) const {
+    if (_keys.empty()) {
+        return nullptr;
+    }
+    const size_t mask = _keys.size() - 1;
+    for (size_t slot = slotOf(key, mask);; slot = (slot + 1) & mask) {
+        if (_keys[slot] == key) {
+            return &_values[slot];
+        }
+        if (_keys[slot] == 0) {
+            return nullptr;
+        }
+    }
+}
+
+uint32_t *SharedPageIndex::PageTable::find(uint64_t key) {
+    return const_cast<uint32_t *>(static_cast<const PageTable *>(this)->find(key));
+}
+
+uint32_t &SharedPageIndex::PageTable::operator[](uint64_t key) {
+    if ((_count + 1) * 2 > _keys.size()) {
+        _grow();
+    }
+    const size_t mask = _keys.size() - 1;
+    size_t slot = slotOf(key, mask);
+    while (_keys[slot] != key && _keys[slot] != 0) {
+        slot = (slot + 1) & mask;
+    }
+    if (_keys[slot] == 0) {
+        _keys[slot] = key;
+        _values[slot] = 0;
+        ++_count;
+    }
+    return _values[slot];
+}
+
+void SharedPageIndex::PageTable::_grow() {
+    std::vector<uint64_t> keys(std::max<size_t>(1024, _keys.size() * 2), 0);
+    std::vector<uint32_t> values(keys.size(), 0);
+    const size_t mask = keys.size() - 1;
+    for (size_t i = 0; i < _keys.size(); ++i) {
+        if (_keys[i] != 0) {
+            size_t slot = slotOf(_keys[i], mask);
+            while (keys[slot] != 0) {
+                slot = (slot + 1) & mask;
+            }
+            keys[slot] = _keys[i];
+            values[slot] = _values[i];
+        }
+    }
+    _keys.swap(keys);
+    _values.swap(values);
+}
+
+void SharedPageIndex::PageTable::clear() {
+    std::vector<uint64_t>().swap(_keys);
+    std::vector<uint32_t>().swap(_values);
+    _count = 0;
+}
 
 uint32_t SharedPageIndex::_internSet(std::vector<int32_t> members) {
     auto [entry, added] = _setIds.try_emplace(members, static_cast<uint32_t>(_sets.size()));
@@ -64,28 +128,37 @@ uint32_t SharedPageIndex::_setWith(uint32_t set, int32_t pid) {
 
 void SharedPageIndex::addPages(int32_t pid, std::span<const uint64_t> keys) {
     std::lock_guard<std::mutex> lock(_mutex);
+    // Neighbouring pages are mostly in the same set: remember the last step.
+    uint32_t lastFrom = UINT32_MAX, lastTo = 0;
     for (const uint64_t key : keys) {
+        if (key == 0) {
+            continue;
+        }
         uint32_t &set = _pages[key];
-        set = _setWith(set, pid);
+        if (set != lastFrom) {
+            lastFrom = set;
+            lastTo = _setWith(set, pid);
+        }
+        set = lastTo;
     }
 }
 
 std::optional<uint32_t> SharedPageIndex::sharedSet(uint64_t key) const {
     std::lock_guard<std::mutex> lock(_mutex);
-    const auto found = _pages.find(key);
-    if (found == _pages.end() || _sets[found->second].size() < 2) {
+    const uint32_t *found = _pages.find(key);
+    if (found == nullptr || _sets[*found].size() < 2) {
         return std::nullopt;
     }
-    return found->second;
+    return *found;
 }
 
 void SharedPageIndex::sharedSets(std::span<const uint64_t> keys, std::vector<uint32_t> &sets) const {
     sets.assign(keys.size(), kNoSet);
     std::lock_guard<std::mutex> lock(_mutex);
     for (size_t i = 0; i < keys.size(); ++i) {
-        const auto found = _pages.find(keys[i]);
-        if (found != _pages.end() && _sets[found->second].size() >= 2) {
-            sets[i] = found->second;
+        const uint32_t *found = _pages.find(keys[i]);
+        if (found != nullptr && _sets[*found].size() >= 2) {
+            sets[i] = *found;
         }
     }
 }

@@ -81,12 +81,28 @@ private:
     uint32_t _internSet(std::vector<int32_t> members);
     uint32_t _setWith(uint32_t set, int32_t pid);
 
+    // Page key -> set: open addressing over keys that are never 0 (frame 0
+    // is never a candidate; swap keys carry kSwapKey), half full at most.
+    class PageTable {
+    public:
+        uint32_t *find(uint64_t key);
+        const uint32_t *find(uint64_t key) const;
+        uint32_t &operator[](uint64_t key);
+        void clear();
+
+    private:
+        void _grow();
+        std::vector<uint64_t> _keys;
+        std::vector<uint32_t> _values;
+        size_t _count = 0;
+    };
+
     mutable std::mutex _mutex;
     // Set 0 is the empty set; a page's entry names the targets seen so far.
     std::vector<std::vector<int32_t>> _sets{{}};
     std::map<std::vector<int32_t>, uint32_t> _setIds{{{}, 0}};
     std::unordered_map<uint64_t, uint32_t> _transitions; // (set << 32 | pid) -> set
-    std::unordered_map<uint64_t, uint32_t> _pages;       // key -> set
+    PageTable _pages;
     std::map<std::pair<uint64_t, uint64_t>, ObjectBits> _objects;
 };
 
