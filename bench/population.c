@@ -205,6 +205,18 @@ int main(int argc, char **argv)
         printf("error: pipe: %s\n", strerror(errno));
         return 1;
     }
+    /* A fork family: memory written once, then shared by every child. */
+    const char *family = getenv("VSBENCH_FAMILY_MIB");
+    if (family != NULL && atol(family) > 0) {
+        size_t bytes = (size_t)atol(family) << 20;
+        char *memory = mmap(NULL, bytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+        if (memory == MAP_FAILED) {
+            printf("error: family memory: %s\n", strerror(errno));
+            return 1;
+        }
+        for (size_t at = 0; at < bytes; at += (size_t)page)
+            memory[at] = (char)(at >> 12);
+    }
     pid_t self = getpid();
     for (int c = 0; c < n; c++) {
         pid_t pid = fork();

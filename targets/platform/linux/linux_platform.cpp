@@ -67,6 +67,14 @@ struct VSLinuxPlatform::Task {
     // Prepared for the run's shared-page resolution: its pages are in the
     // index, so its walk looks them up there (kept across parses).
     bool prepared = false;
+    // The keys prepare_task_walk read, by mapping, kept for the first walk
+    // so that it need not read the frames again; dropped once used.
+    struct StoredKeys {
+        uint64_t start, end;
+        size_t begin, length; // within storedBytes
+    };
+    std::vector<StoredKeys> storedKeys;
+    std::vector<uint8_t> storedBytes;
     // The status read for the kernel-memory counters, kept for the one
     // resource-usage query that a target makes right after it (both are
     // taken at construction); used once, then dropped.
@@ -824,23 +832,31 @@ void VSLinuxPlatform::_buildParts(Task &task) {
     UniqueFd pagemap;
     bool pagemapFailed = false;
     std::vector<vs::SharedAnonymousPart> shared;
-    std::vector<uint64_t> keys;
-    std::vector<uint32_t> sets;
+    thread_local std::vector<uint64_t> keys;
+    thread_local std::vector<uint32_t> sets;
     for (uint32_t i = 0; i < task.regions.size(); ++i) {
         const SmapsRegion &region = task.regions[i];
         const vs::MappingKind kind = task.kinds[i];
         shared.clear();
         std::optional<vs::ObjectPages> objectPages;
         if (resolved && vs::mayShareAnonymousPages(region, kind) && !pagemapFailed) {
-            // A second look at the frames: the index knows which sets they
-            // are in now that every target has been seen.
-            if (!pagemap.valid()) {
+            // The frames as first seen (or a second look at them): the index
+            // knows which sets they are in now that every target was seen.
+            keys.clear();
+            const auto stored = std::find_if(task.storedKeys.begin(), task.storedKeys.end(), [&](const auto &s) {
+                return s.start == region.start && s.end == region.end;
+            });
+            if (stored != task.storedKeys.end()) {
+                vs::decodeKeyRuns(std::span<const uint8_t>(task.storedBytes.data() + stored->begin, stored->length),
+                                  keys);
+            } else if (!pagemap.valid()) {
                 pagemap = UniqueFd(::openat(task.dir.get(), "pagemap", O_RDONLY | O_CLOEXEC));
                 pagemapFailed = !pagemap.valid();
             }
-            if (pagemap.valid()) {
-                keys.clear();
-                _candidateKeys(pagemap.get(), region, keys, nullptr);
+            if (stored != task.storedKeys.end() || pagemap.valid()) {
+                if (stored == task.storedKeys.end()) {
+                    _candidateKeys(pagemap.get(), region, keys, nullptr);
+                }
                 _sharedPages.sharedSets(keys, sets);
                 // Counted by set first; a region meets few sets.
                 std::vector<std::pair<uint32_t, vs::SharedAnonymousPart>> bySet;
@@ -876,6 +892,11 @@ void VSLinuxPlatform::_buildParts(Task &task) {
     }
     task.firstPart.push_back(static_cast<uint32_t>(task.parts.size()));
     task.partsBuilt = true;
+    if (!task.storedBytes.empty()) {
+        _storedKeyBytes.fetch_sub(task.storedBytes.capacity());
+    }
+    std::vector<Task::StoredKeys>().swap(task.storedKeys);
+    std::vector<uint8_t>().swap(task.storedBytes);
 }
 
 bool VSLinuxPlatform::_isSharedWindow(const SmapsRegion &region, vs::MappingKind kind) const {
@@ -923,7 +944,10 @@ void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, s
 bool VSLinuxPlatform::_readPagemap(int pagemapFd, uint64_t address, uint64_t pages,
                                    const std::function<bool(std::span<const uint64_t>, uint64_t)> &batch) {
     constexpr uint64_t kBatch = 16384; // 128 KiB of entries per read
-    std::vector<uint64_t> entries(std::min(pages, kBatch));
+    // One buffer per thread: fresh pages for every mapping cost more than
+    // the reads.
+    thread_local std::vector<uint64_t> entries;
+    entries.resize(kBatch);
     for (uint64_t done = 0; done < pages;) {
         const uint64_t want = std::min(pages - done, kBatch);
         const off_t offset = static_cast<off_t>((address / _pageSize + done) * sizeof(uint64_t));
@@ -949,13 +973,14 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
         return false;
     }
     std::lock_guard<std::mutex> lock(task->mutex);
-    if (_ensureParsed(*task) != 0 || task->prepared) {
+    // Once the run has resolved its sharing, a late target shares nothing.
+    if (_ensureParsed(*task) != 0 || task->prepared || _sharedPagesResolved.load()) {
         return task->prepared;
     }
     constexpr uint64_t kPresent = 1ull << 63;
     constexpr uint64_t kPfnMask = (1ull << 55) - 1;
     UniqueFd pagemap;
-    std::vector<uint64_t> keys;
+    thread_local std::vector<uint64_t> keys;
     std::vector<uint64_t> pfns;
     bool framesUnreadable = false;
     bool any = false;
@@ -979,6 +1004,9 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
             keys.clear();
             _candidateKeys(pagemap.get(), region, keys, &framesUnreadable);
             _sharedPages.addPages(task->pid, keys);
+            const size_t before = task->storedBytes.size();
+            vs::encodeKeyRuns(keys, task->storedBytes);
+            task->storedKeys.push_back({region.start, region.end, before, task->storedBytes.size() - before});
             continue;
         }
         // A shared mapping: which file pages it holds, and which of them are
@@ -1019,6 +1047,13 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
     if (framesUnreadable) {
         _sharedFramesUnreadable.store(true);
     }
+    // Kept within a budget; beyond it the walk reads the frames again.
+    task->storedBytes.shrink_to_fit();
+    if (_storedKeyBytes.fetch_add(task->storedBytes.capacity()) + task->storedBytes.capacity() > kStoredKeyBudget) {
+        _storedKeyBytes.fetch_sub(task->storedBytes.capacity());
+        std::vector<Task::StoredKeys>().swap(task->storedKeys);
+        std::vector<uint8_t>().swap(task->storedBytes);
+    }
     task->prepared = true;
     task->partsBuilt = false;
     return any;
@@ -1051,6 +1086,7 @@ void VSLinuxPlatform::_dirtyFrames(const std::vector<uint64_t> &pfns, const std:
 }
 
 bool VSLinuxPlatform::resolve_shared_pages() {
+    _sharedPages.freeze();
     _sharedPagesResolved.store(true);
     return !_sharedFramesUnreadable.load();
 }

@@ -164,6 +164,9 @@ private:
     vs::SharedPageIndex _sharedPages;
     std::atomic<bool> _sharedPagesResolved{false};
     std::atomic<bool> _sharedFramesUnreadable{false};
+    // Bytes of page keys tasks keep from preparation to walk, at most the budget.
+    static constexpr size_t kStoredKeyBudget = 16u << 20;
+    std::atomic<size_t> _storedKeyBytes{0};
 
     std::once_flag _kpageflagsOnce;
     int _kpageflagsFd = -1;

@@ -36,69 +36,114 @@ bool testBit(const std::vector<uint64_t> &bits, uint64_t index) {
     return index / 64 < bits.size() && (bits[index / 64] >> (index % 64) & 1) != 0;
 }
 
+void putNumber(uint64_t value, std::vector<uint8_t> &out) {
+    while (value >= 0x80) {
+        out.push_back(static_cast<uint8_t>(value | 0x80));
+        value >>= 7;
+    }
+    out.push_back(static_cast<uint8_t>(value));
+}
+
+uint64_t takeNumber(std::span<const uint8_t> bytes, size_t &at) {
+    uint64_t value = 0;
+    for (unsigned shift = 0; at < bytes.size() && shift < 64; shift += 7) {
+        const uint8_t byte = bytes[at++];
+        value |= uint64_t{byte & 0x7Fu} << shift;
+        if ((byte & 0x80) == 0) {
+            break;
+        }
+    }
+    return value;
+}
+
 size_t slotOf(uint64_t key, size_t mask) {
     return static_cast<size_t>((key * 0x9E3779B97F4A7C15ull) >> 17) & mask;
 }
 
 } // namespace
 
-const uint32_t *SharedPageIndex::PageTable::find(uint64_t key) const {
-    if (_keys.empty()) {
+void encodeKeyRuns(std::span<const uint64_t> keys, std::vector<uint8_t> &out) {
+    uint64_t next = 0; // the key after the last run
+    for (size_t i = 0; i < keys.size();) {
+        size_t length = 1;
+        while (i + length < keys.size() && keys[i + length] == keys[i] + length) {
+            ++length;
+        }
+        // The distance either way, its sign in the lowest bit.
+        const uint64_t distance = keys[i] - next;
+        putNumber((distance << 1) ^ static_cast<uint64_t>(static_cast<int64_t>(distance) >> 63), out);
+        putNumber(length, out);
+        next = keys[i] + length;
+        i += length;
+    }
+}
+
+void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<uint64_t> &keys) {
+    uint64_t next = 0;
+    for (size_t at = 0; at < bytes.size();) {
+        const uint64_t coded = takeNumber(bytes, at);
+        const uint64_t distance = (coded >> 1) ^ (0 - (coded & 1));
+        const uint64_t length = takeNumber(bytes, at);
+        const uint64_t first = next + distance;
+        for (uint64_t k = 0; k < length; ++k) {
+            keys.push_back(first + k);
+        }
+        next = first + length;
+    }
+}
+
+const uint32_t *SharedPageIndex::PageTable::find(uint64_t block) const {
+    if (_blocks.empty()) {
         return nullptr;
     }
-    const size_t mask = _keys.size() - 1;
-    for (size_t slot = slotOf(key, mask);; slot = (slot + 1) & mask) {
-        if (_keys[slot] == key) {
-            return &_values[slot];
+    const size_t mask = _blocks.size() - 1;
+    for (size_t slot = slotOf(block, mask);; slot = (slot + 1) & mask) {
+        if (_blocks[slot] == block + 1) {
+            return &_sets[slot * kLanes];
         }
-        if (_keys[slot] == 0) {
+        if (_blocks[slot] == 0) {
             return nullptr;
         }
     }
 }
 
-uint32_t *SharedPageIndex::PageTable::find(uint64_t key) {
-    return const_cast<uint32_t *>(static_cast<const PageTable *>(this)->find(key));
-}
-
-uint32_t &SharedPageIndex::PageTable::operator[](uint64_t key) {
-    if ((_count + 1) * 2 > _keys.size()) {
+uint32_t *SharedPageIndex::PageTable::findOrAdd(uint64_t block) {
+    if ((_count + 1) * 10 > _blocks.size() * 7) {
         _grow();
     }
-    const size_t mask = _keys.size() - 1;
-    size_t slot = slotOf(key, mask);
-    while (_keys[slot] != key && _keys[slot] != 0) {
+    const size_t mask = _blocks.size() - 1;
+    size_t slot = slotOf(block, mask);
+    while (_blocks[slot] != block + 1 && _blocks[slot] != 0) {
         slot = (slot + 1) & mask;
     }
-    if (_keys[slot] == 0) {
-        _keys[slot] = key;
-        _values[slot] = 0;
+    if (_blocks[slot] == 0) {
+        _blocks[slot] = block + 1;
         ++_count;
     }
-    return _values[slot];
+    return &_sets[slot * kLanes];
 }
 
 void SharedPageIndex::PageTable::_grow() {
-    std::vector<uint64_t> keys(std::max<size_t>(1024, _keys.size() * 2), 0);
-    std::vector<uint32_t> values(keys.size(), 0);
-    const size_t mask = keys.size() - 1;
-    for (size_t i = 0; i < _keys.size(); ++i) {
-        if (_keys[i] != 0) {
-            size_t slot = slotOf(_keys[i], mask);
-            while (keys[slot] != 0) {
+    std::vector<uint64_t> blocks(std::max<size_t>(1024, _blocks.size() * 2), 0);
+    std::vector<uint32_t> sets(blocks.size() * kLanes, 0);
+    const size_t mask = blocks.size() - 1;
+    for (size_t i = 0; i < _blocks.size(); ++i) {
+        if (_blocks[i] != 0) {
+            size_t slot = slotOf(_blocks[i] - 1, mask);
+            while (blocks[slot] != 0) {
                 slot = (slot + 1) & mask;
             }
-            keys[slot] = _keys[i];
-            values[slot] = _values[i];
+            blocks[slot] = _blocks[i];
+            std::copy_n(&_sets[i * kLanes], kLanes, &sets[slot * kLanes]);
         }
     }
-    _keys.swap(keys);
-    _values.swap(values);
+    _blocks.swap(blocks);
+    _sets.swap(sets);
 }
 
 void SharedPageIndex::PageTable::clear() {
-    std::vector<uint64_t>().swap(_keys);
-    std::vector<uint32_t>().swap(_values);
+    std::vector<uint64_t>().swap(_blocks);
+    std::vector<uint32_t>().swap(_sets);
     _count = 0;
 }
 
@@ -127,38 +172,83 @@ uint32_t SharedPageIndex::_setWith(uint32_t set, int32_t pid) {
 }
 
 void SharedPageIndex::addPages(int32_t pid, std::span<const uint64_t> keys) {
-    std::lock_guard<std::mutex> lock(_mutex);
-    // Neighbouring pages are mostly in the same set: remember the last step.
-    uint32_t lastFrom = UINT32_MAX, lastTo = 0;
+    thread_local std::array<std::vector<uint64_t>, kShards> byShard;
+    for (auto &bucket : byShard) {
+        bucket.clear();
+    }
     for (const uint64_t key : keys) {
-        if (key == 0) {
+        if (key != 0) {
+            byShard[_shardOf(key)].push_back(key);
+        }
+    }
+    // A target takes each set it meets to one other set (itself added):
+    // those steps are remembered here, away from the shared table.
+    std::vector<std::pair<uint32_t, uint32_t>> steps;
+    auto step = [&](uint32_t from) {
+        for (const auto &[known, to] : steps) {
+            if (known == from) {
+                return to;
+            }
+        }
+        std::lock_guard<std::mutex> lock(_mutex);
+        const uint32_t to = _setWith(from, pid);
+        steps.emplace_back(from, to);
+        return to;
+    };
+    for (size_t shard = 0; shard < kShards; ++shard) {
+        if (byShard[shard].empty()) {
             continue;
         }
-        uint32_t &set = _pages[key];
-        if (set != lastFrom) {
-            lastFrom = set;
-            lastTo = _setWith(set, pid);
+        std::lock_guard<std::mutex> lock(_shards[shard].mutex);
+        // Neighbouring pages are mostly in the same block and set: the last
+        // of each first.
+        uint32_t lastFrom = UINT32_MAX, lastTo = 0;
+        uint64_t lastBlock = UINT64_MAX;
+        uint32_t *lanes = nullptr;
+        for (const uint64_t key : byShard[shard]) {
+            if ((key >> kBlockShift) != lastBlock) {
+                lastBlock = key >> kBlockShift;
+                lanes = _shards[shard].pages.findOrAdd(lastBlock);
+            }
+            uint32_t &set = lanes[key & (PageTable::kLanes - 1)];
+            if (set != lastFrom) {
+                lastFrom = set;
+                lastTo = step(set);
+            }
+            set = lastTo;
         }
-        set = lastTo;
     }
 }
 
 std::optional<uint32_t> SharedPageIndex::sharedSet(uint64_t key) const {
-    std::lock_guard<std::mutex> lock(_mutex);
-    const uint32_t *found = _pages.find(key);
-    if (found == nullptr || _sets[*found].size() < 2) {
-        return std::nullopt;
-    }
-    return *found;
+    std::vector<uint32_t> sets;
+    sharedSets(std::span<const uint64_t>(&key, 1), sets);
+    return sets[0] == kNoSet ? std::nullopt : std::optional<uint32_t>(sets[0]);
 }
 
 void SharedPageIndex::sharedSets(std::span<const uint64_t> keys, std::vector<uint32_t> &sets) const {
     sets.assign(keys.size(), kNoSet);
-    std::lock_guard<std::mutex> lock(_mutex);
+    const bool frozen = _frozen.load();
+    std::unique_lock<std::mutex> setsLock(_mutex, std::defer_lock);
+    if (!frozen) {
+        setsLock.lock();
+    }
+    uint64_t lastBlock = UINT64_MAX;
+    const uint32_t *lanes = nullptr;
     for (size_t i = 0; i < keys.size(); ++i) {
-        const uint32_t *found = _pages.find(keys[i]);
-        if (found != nullptr && _sets[*found].size() >= 2) {
-            sets[i] = *found;
+        Shard &shard = _shards[_shardOf(keys[i])];
+        std::unique_lock<std::mutex> lock(shard.mutex, std::defer_lock);
+        if (!frozen) {
+            lock.lock();
+            lastBlock = UINT64_MAX; // another thread may have moved the block
+        }
+        if ((keys[i] >> kBlockShift) != lastBlock) {
+            lastBlock = keys[i] >> kBlockShift;
+            lanes = shard.pages.find(lastBlock);
+        }
+        const uint32_t set = lanes == nullptr ? 0 : lanes[keys[i] & (PageTable::kLanes - 1)];
+        if (_sets[set].size() >= 2) {
+            sets[i] = set;
         }
     }
 }
@@ -208,8 +298,12 @@ void SharedPageIndex::clear() {
     _sets.assign(1, {});
     _setIds = {{{}, 0}};
     _transitions.clear();
-    _pages.clear();
     _objects.clear();
+    for (Shard &shard : _shards) {
+        std::lock_guard<std::mutex> shardLock(shard.mutex);
+        shard.pages.clear();
+    }
+    _frozen.store(false);
 }
 
 } // namespace vs

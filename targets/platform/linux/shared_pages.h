@@ -12,6 +12,8 @@
 // walked; the walk then only looks up. The index holds one entry per page
 // that may be shared, never one per process and page.
 
+#include <array>
+#include <atomic>
 #include <cstdint>
 #include <map>
 #include <mutex>
@@ -26,6 +28,14 @@ namespace vs {
 // Swapped pages are keyed by their swap entry with this bit set, so that
 // they never meet a frame number (frame numbers have at most 55 bits).
 inline constexpr uint64_t kSwapKey = 1ull << 63;
+
+// A process's page keys kept between its first look and its walk, small:
+// a page's frame mostly follows the previous page's, so runs of
+// consecutive keys are stored as (distance from the last run, length),
+// each a variable-length number.
+void encodeKeyRuns(std::span<const uint64_t> keys, std::vector<uint8_t> &out);
+// Appends the keys of `bytes` (as encodeKeyRuns wrote them) to `keys`.
+void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<uint64_t> &keys);
 
 class SharedPageIndex {
 public:
@@ -68,6 +78,9 @@ public:
     std::optional<Pages> objectPages(uint64_t device, uint64_t inode, uint64_t firstPage,
                                      uint64_t pageCount) const;
 
+    // No page is added from now on: lookups need no locks.
+    void freeze() { _frozen.store(true); }
+
     void clear();
 
 private:
@@ -81,28 +94,45 @@ private:
     uint32_t _internSet(std::vector<int32_t> members);
     uint32_t _setWith(uint32_t set, int32_t pid);
 
-    // Page key -> set: open addressing over keys that are never 0 (frame 0
-    // is never a candidate; swap keys carry kSwapKey), half full at most.
+    // Page key -> set, by blocks of 8 neighbouring keys (a process's
+    // frames come in runs, so one probe serves several pages): open
+    // addressing over block numbers, at most 70% full. A key never seen
+    // reads as set 0, the empty set.
+    static constexpr unsigned kBlockShift = 3;
     class PageTable {
     public:
-        uint32_t *find(uint64_t key);
-        const uint32_t *find(uint64_t key) const;
-        uint32_t &operator[](uint64_t key);
+        static constexpr size_t kLanes = size_t{1} << kBlockShift;
+        // The sets of a block's keys, or null when none was added.
+        const uint32_t *find(uint64_t block) const;
+        // The same, made when missing; valid until the next call.
+        uint32_t *findOrAdd(uint64_t block);
         void clear();
 
     private:
         void _grow();
-        std::vector<uint64_t> _keys;
-        std::vector<uint32_t> _values;
+        std::vector<uint64_t> _blocks; // block + 1; 0: a free slot
+        std::vector<uint32_t> _sets;   // kLanes per slot
         size_t _count = 0;
     };
 
-    mutable std::mutex _mutex;
+    // Pages are spread over shards, each with its own lock, so that
+    // targets add their pages side by side.
+    static constexpr size_t kShards = 16;
+    struct Shard {
+        std::mutex mutex;
+        PageTable pages;
+    };
+    static size_t _shardOf(uint64_t key) {
+        return static_cast<size_t>(((key >> kBlockShift) * 0x9E3779B97F4A7C15ull) >> 60);
+    }
+
+    mutable std::mutex _mutex; // the sets and the objects
+    std::atomic<bool> _frozen{false};
+    mutable std::array<Shard, kShards> _shards;
     // Set 0 is the empty set; a page's entry names the targets seen so far.
     std::vector<std::vector<int32_t>> _sets{{}};
     std::map<std::vector<int32_t>, uint32_t> _setIds{{{}, 0}};
     std::unordered_map<uint64_t, uint32_t> _transitions; // (set << 32 | pid) -> set
-    PageTable _pages;
     std::map<std::pair<uint64_t, uint64_t>, ObjectBits> _objects;
 };
 
