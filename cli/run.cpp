@@ -1,6 +1,9 @@
 #include "cli/run.h"
 
+#include <cerrno>
+#include <csignal>
 #include <cstdio>
+#include <cstring>
 #include <filesystem>
 #include <memory>
 #include <set>
@@ -172,13 +175,27 @@ int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArgum
     if (interrupt) {
         interrupt->cancel();
         interrupt.reset();
+        // From here on an interrupt ends the program, also when it was
+        // started with SIGINT ignored (a background job of a script).
+        std::signal(SIGINT, SIG_DFL);
     }
 
     vestage.addOutputFormatter(std::make_unique<VSOutputFormatterText>(options.summaryFormat, options.outputOptions));
     if (options.jsonPath) {
         vestage.addOutputFormatter(std::make_unique<VSOutputFormatterJSON>(*options.jsonPath));
     }
+    // A report cut short by a full disk must not pass for a whole one; the
+    // reason is the first failed write's (later ones keep errno as it is).
+    errno = 0;
     vestage.printOutputVerbose(options.verbose, options.summarize);
+    const int printError = errno;
+    errno = 0;
+    const bool flushed = std::fflush(stdout) == 0;
+    if (!flushed || std::ferror(stdout)) {
+        const int error = !flushed && errno != 0 ? errno : (printError != 0 ? printError : EIO);
+        std::fprintf(stderr, "vestage: cannot write the report to standard output: %s\n", std::strerror(error));
+        return 1;
+    }
     return 0;
 }
 

@@ -1,6 +1,7 @@
 // Whole runs against live children whose memory the test arranged, and interrupted.
 
 #include <fstream>
+#include <sys/ioctl.h>
 #include <nlohmann/json.hpp>
 #include <regex>
 
@@ -153,6 +154,57 @@ TEST(LiveRun, SharingAfterForkUnresolvedWithoutRootIsSaid) {
     const nlohmann::json document = nlohmann::json::parse(in, nullptr, false);
     ASSERT_FALSE(document.is_discarded());
     EXPECT_EQ(document.value("notes", nlohmann::json::array()), nlohmann::json::array({note}));
+}
+
+// A report that cannot be written whole is an error, not a success.
+TEST(LiveRun, ReportThatCannotBeWrittenFailsTheRun) {
+    if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";
+    MemChild child({"anon:a:4:4"});
+    ASSERT_TRUE(child.ready());
+    const auto run = runProgram({"-p", std::to_string(child.pid())}, {.standardOutput = "/dev/full"});
+    EXPECT_EQ(run.status, 1);
+    EXPECT_EQ(run.err, "vestage: cannot write the report to standard output: No space left on device\n");
+}
+
+// Started with SIGINT ignored, as a background job of a script is: once
+// gathering is over an interrupt ends the program again.
+TEST(LiveRun, InterruptEndsThePrintingEvenWhenStartedIgnored) {
+    if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
+    int out[2];
+    ASSERT_EQ(pipe2(out, O_CLOEXEC), 0);
+    fcntl(out[1], F_SETPIPE_SZ, 4096);  // the report fills it long before its end
+    const pid_t pid = fork();
+    if (pid == 0) {
+        signal(SIGINT, SIG_IGN);
+        dup2(out[1], 1);
+        const int devNull = open("/dev/null", O_RDWR | O_CLOEXEC);
+        dup2(devNull, 0);
+        dup2(devNull, 2);
+        execl(VESTAGE_TEST_BIN_DIR "/vestage", "vestage", "-a", "-v", static_cast<char *>(nullptr));
+        _exit(127);
+    }
+    close(out[1]);
+    // Wait until the report has filled the pipe: gathering is over, and the
+    // program is held in its first writes.
+    const int capacity = fcntl(out[0], F_GETPIPE_SZ);
+    for (int queued = 0; queued < capacity;) {
+        ASSERT_EQ(waitpid(pid, nullptr, WNOHANG), 0) << "ended before its report filled the pipe";
+        ASSERT_EQ(ioctl(out[0], FIONREAD, &queued), 0);
+        usleep(1000);
+    }
+    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+    std::string line, ignored;
+    while (std::getline(status, line)) {
+        if (line.rfind("SigIgn:", 0) == 0) ignored = line.substr(7);
+    }
+    const bool stillIgnored = (std::stoull(ignored, nullptr, 16) & (1ull << (SIGINT - 1))) != 0;
+    // Ignored, SIGINT would leave it blocked on the pipe for good.
+    kill(pid, stillIgnored ? SIGKILL : SIGINT);
+    EXPECT_FALSE(stillIgnored) << "SIGINT still ignored after gathering";
+    int wait = 0;
+    ASSERT_EQ(waitpid(pid, &wait, 0), pid);
+    EXPECT_TRUE(WIFSIGNALED(wait) && WTERMSIG(wait) == SIGINT) << wait;
+    close(out[0]);
 }
 
 TEST(LiveRun, InterruptDuringGatheringStillReports) {

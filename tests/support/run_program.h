@@ -33,6 +33,7 @@ struct RunSettings {
     std::optional<int> descriptor3 = std::nullopt;
     bool closeOutputs = false, closeInput = false;
     uid_t user = 0;  // run as this user (and its own group) when not 0
+    std::string standardOutput = "";  // a file to write standard output to, instead of the result
 };
 
 // Drops to an unprivileged user for the rest of a forked child's life.
@@ -62,7 +63,12 @@ inline RunResult runProgram(const std::vector<std::string> &args, const RunSetti
     if (child == 0) {
         // Standard streams first: a file may sit on descriptor 3 until then.
         s.closeInput ? close(0) : dup2(devNull, 0);
-        s.closeOutputs ? close(1) : dup2(out, 1);
+        if (!s.standardOutput.empty()) {
+            const int file = open(s.standardOutput.c_str(), O_WRONLY | O_CLOEXEC);
+            dup2(file, 1);
+        } else {
+            s.closeOutputs ? close(1) : dup2(out, 1);
+        }
         s.closeOutputs ? close(2) : dup2(err, 2);
         if (s.descriptor3 && *s.descriptor3 < 0) {
             close(3);
