@@ -104,23 +104,55 @@ TEST(CorpseRun, HandedOverSnapshotIsReportedInTheJsonFile) {
 }
 
 // A kernel setting under /proc/sys, put back as it was on destruction.
+// A machine-wide setting changed for one test and put back afterwards:
+// by the test when it ends, failed or not, and by a guardian process when
+// the test is killed before it could.
 struct KernelSetting {
     explicit KernelSetting(const std::string &p) : path(p) { std::getline(std::ifstream(path) >> std::ws, saved); }
     ~KernelSetting() {
         if (changed) {
-            EXPECT_TRUE(write(saved)) << "could not restore " << path;
+            EXPECT_TRUE(put(saved)) << "could not restore " << path;
+        }
+        if (guardian > 0) {
+            (void)!::write(guardianPipe, "r", 1);  // restored: the guardian has nothing to do
+            close(guardianPipe);
+            waitpid(guardian, nullptr, 0);
         }
     }
     bool write(const std::string &value) {
+        if (guardian <= 0) startGuardian();
         changed = true;
+        return put(value);
+    }
+    bool put(const std::string &value) const {
         return static_cast<bool>(std::ofstream(path) << value << "\n" << std::flush);
+    }
+    // Waits for end of file on a pipe only this process holds open: without
+    // the "restored" byte first, the test died and the setting is put back.
+    void startGuardian() {
+        int fds[2];
+        if (pipe2(fds, O_CLOEXEC) != 0) return;
+        guardian = fork();
+        if (guardian == 0) {
+            close(fds[1]);
+            char byte = 0;
+            if (::read(fds[0], &byte, 1) != 1) put(saved);
+            _exit(0);
+        }
+        close(fds[0]);
+        guardianPipe = fds[1];
     }
     std::string path, saved;
     bool changed = false;
+    pid_t guardian = -1;
+    int guardianPipe = -1;
 };
 
 TEST(CorpseRun, CrashRoutedThroughCorePatternIsReported) {
     if (geteuid() != 0) GTEST_SKIP() << "installing a crash helper needs root";
+    if (std::getenv("VESTAGE_TEST_KEEP_SYSTEM_SETTINGS") != nullptr) {
+        GTEST_SKIP() << "VESTAGE_TEST_KEEP_SYSTEM_SETTINGS is set: core_pattern stays as it is";
+    }
     // Since 6.16 the kernel hands a crash helper the crashing task's pidfd (%F).
     utsname name{};
     int major = 0, minor = 0;

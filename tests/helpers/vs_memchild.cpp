@@ -39,6 +39,8 @@
 // kernel cannot merge it with a neighbour of the same protection.
 
 #include <algorithm>
+#include <atomic>
+#include <sched.h>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
@@ -109,11 +111,13 @@ void printRegion(const std::string &label, const void *start, size_t pages) {
 }
 
 int gBlockPipe[2] = {-1, -1};
+std::atomic<long> gLastThreadId{0};
 int gStartedPipe[2] = {-1, -1};
 
 void *blockedThread(void *arg) {
     const std::string label = *static_cast<std::string *>(arg);
     volatile char local = 0;
+    gLastThreadId.store(static_cast<long>(syscall(SYS_gettid)));
     std::printf("%s tid=%ld local=%lx\n", label.c_str(), static_cast<long>(syscall(SYS_gettid)),
                 reinterpret_cast<unsigned long>(&local));
     std::fflush(stdout);
@@ -330,6 +334,21 @@ int main(int argc, char **argv) {
             char started;
             if (read(gStartedPipe[0], &started, 1) != 1) {
                 fail("read");
+            }
+            // Said before it blocks: until its syscall file names the read,
+            // a reader would find it running and without a stack pointer.
+            const std::string syscallFile = "/proc/self/task/" + std::to_string(gLastThreadId.load()) + "/syscall";
+            for (;;) {
+                char text[64] = {};
+                const int fd = open(syscallFile.c_str(), O_RDONLY | O_CLOEXEC);
+                const ssize_t n = fd < 0 ? -1 : read(fd, text, sizeof text - 1);
+                if (fd >= 0) {
+                    close(fd);
+                }
+                if (n > 0 && std::strncmp(text, "running", 7) != 0) {
+                    break;
+                }
+                sched_yield();
             }
         } else if (kind == "libc" && item.size() == 2) {
             std::string copy = label;
