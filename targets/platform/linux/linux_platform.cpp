@@ -992,7 +992,9 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
         if (!anonymous && !window) {
             continue;
         }
-        any = true;
+        // A shared mapping holding its whole range is exact on its own:
+        // its walk need not wait for the others' pages.
+        any = any || anonymous || region.rss < region.size();
         if (!pagemap.valid()) {
             pagemap = UniqueFd(::openat(task->dir.get(), "pagemap", O_RDONLY | O_CLOEXEC));
             if (!pagemap.valid()) {
@@ -1021,7 +1023,7 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
         const bool whole = region.rss == region.size();
         if (region.rss == 0) {
             pages.present.assign(1, 0);
-        } else if (!whole || !shmem) {
+        } else if (!whole) {
             pages.present.assign((pages.pageCount + 63) / 64, 0);
             pfns.clear();
             _readPagemap(pagemap.get(), region.start, pages.pageCount,
@@ -1061,6 +1063,8 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
 
 void VSLinuxPlatform::_dirtyFrames(const std::vector<uint64_t> &pfns, const std::vector<uint64_t> &present,
                                    std::vector<uint64_t> &dirty) {
+    // Neighbouring pages of a file often sit in neighbouring frames: one
+    // read serves a run of them.
     std::call_once(_kpageflagsOnce, [this] {
         _kpageflagsFd = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC);
     });
@@ -1068,20 +1072,28 @@ void VSLinuxPlatform::_dirtyFrames(const std::vector<uint64_t> &pfns, const std:
         return;
     }
     constexpr uint64_t kDirtyPageFlag = 1ull << 4;
+    constexpr size_t kRun = 64;
     dirty.assign(present.size(), 0);
-    // pfns are in page order, one per set bit of `present`.
-    size_t next = 0;
-    uint64_t flags = 0;
-    for (uint64_t page = 0; page < present.size() * 64 && next < pfns.size(); ++page) {
-        if ((present[page / 64] >> (page % 64) & 1) == 0) {
-            continue;
+    std::vector<uint64_t> pages; // page index of each pfn, in page order
+    for (uint64_t page = 0; page < present.size() * 64 && pages.size() < pfns.size(); ++page) {
+        if ((present[page / 64] >> (page % 64) & 1) != 0) {
+            pages.push_back(page);
         }
-        const uint64_t pfn = pfns[next++];
-        if (::pread(_kpageflagsFd, &flags, sizeof flags, static_cast<off_t>(pfn * sizeof flags)) ==
-                static_cast<ssize_t>(sizeof flags) &&
-            (flags & kDirtyPageFlag) != 0) {
-            dirty[page / 64] |= 1ull << (page % 64);
+    }
+    uint64_t flags[kRun];
+    for (size_t i = 0; i < pages.size();) {
+        size_t length = 1;
+        while (i + length < pages.size() && length < kRun && pfns[i + length] == pfns[i] + length) {
+            ++length;
         }
+        const ssize_t n = ::pread(_kpageflagsFd, flags, length * sizeof(uint64_t),
+                                  static_cast<off_t>(pfns[i] * sizeof(uint64_t)));
+        for (size_t k = 0; n > 0 && k < static_cast<size_t>(n) / sizeof(uint64_t); ++k) {
+            if ((flags[k] & kDirtyPageFlag) != 0) {
+                dirty[pages[i + k] / 64] |= 1ull << (pages[i + k] % 64);
+            }
+        }
+        i += length;
     }
 }
 
