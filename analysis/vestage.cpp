@@ -95,6 +95,13 @@ void VSVestage::gatherData() {
             }
         });
     }
+    if (const auto [bytes, processes] = VSProcess::uncountedResident(); processes != 0) {
+        char text[160];
+        std::snprintf(text, sizeof text, "Not counted: %.1f MiB (%llu bytes) resident in %u %s that could not be read",
+                      static_cast<double>(bytes) / (1 << 20), static_cast<unsigned long long>(bytes), processes,
+                      processes == 1 ? "process" : "processes");
+        VSProcess::_addGlobalNote(text);
+    }
     if (_earlyExit.load()) {
         VSProcess::_addGlobalError(kEarlyExitError);
     }

@@ -233,6 +233,7 @@ void VSKernelProcess::_addWiredData(std::span<const VSKernelSiteInfo> infos, uin
         // Only the tag means that; a module or counter numbered 24 is not.
         const bool userWired =
             (info.flags & vs::kSiteTypeMask) == vs::kSiteTypeTag && info.site == vs::kKernelSiteUserWired;
+        uint64_t giveBack = 0;
         if ((info.flags & vs::kSiteFlagZoneShare) != 0 || !wired || hidden || userWired) {
             region->setCleanNonSpecSize(value);
             region->setDirtySize(0);
@@ -242,12 +243,14 @@ void VSKernelProcess::_addWiredData(std::span<const VSKernelSiteInfo> infos, uin
                 region->setDetailedName("(user wired)");
             }
         } else {
-            region->setDirtySize(value);
+            // A site may say how much of it the kernel can give back.
+            giveBack = std::min(info.collectable, value);
+            region->setDirtySize(value - giveBack);
             region->setCleanNonSpecSize(0);
         }
         region->setWiredSize(wired ? value : 0);
         region->setSwappedSize(0);
-        region->setReclaimableSize(0);
+        region->setReclaimableSize(giveBack);
         region->setSize(value);
         region->setUser_tag(i);
         region->setObject_id(objectIdForSite(info));

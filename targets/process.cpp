@@ -23,6 +23,8 @@ namespace {
 std::once_flag globalErrorsOnce;
 std::optional<std::vector<std::string>> globalErrorList;
 std::vector<std::string> globalNoteList;
+std::atomic<uint64_t> uncountedBytes{0};
+std::atomic<uint32_t> uncountedProcesses{0};
 
 // Text of a fixed-width, zero-padded field that need not be terminated.
 std::string fixedField(const char *field, size_t width) {
@@ -196,6 +198,8 @@ void VSProcess::_clearGlobalErrors() {
         globalErrorList->clear();
     }
     globalNoteList.clear();
+    uncountedBytes = 0;
+    uncountedProcesses = 0;
 }
 
 void VSProcess::_addGlobalNote(std::string note) {
@@ -205,6 +209,13 @@ void VSProcess::_addGlobalNote(std::string note) {
 }
 
 std::vector<std::string> VSProcess::globalNotes() { return globalNoteList; }
+
+void VSProcess::_addUncountedResident(uint64_t bytes) {
+    uncountedBytes += bytes;
+    uncountedProcesses += 1;
+}
+
+std::pair<uint64_t, uint32_t> VSProcess::uncountedResident() { return {uncountedBytes.load(), uncountedProcesses.load()}; }
 
 std::vector<std::string> VSProcess::globalErrors() {
     if (!globalErrorList) {

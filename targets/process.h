@@ -102,6 +102,10 @@ public:
     // Notes on how the figures were obtained, tied to no target; unlike
     // errors they leave the summary valid. Main thread only.
     static void _addGlobalNote(std::string note);
+    // Memory resident in processes that were to be read but could not be
+    // (no right to open them): the report says how much it left out.
+    static void _addUncountedResident(uint64_t bytes);
+    static std::pair<uint64_t, uint32_t> uncountedResident(); // bytes, processes
     static std::vector<std::string> globalNotes();
 
     // ---- names ---------------------------------------------------------------

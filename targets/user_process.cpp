@@ -103,6 +103,10 @@ bool VSUserProcess::_populateTask() {
     if (code != vs::kReturnSuccess) {
         platform.report_error_code("task_handle_for_pid", code);
         _addGlobalError("task_handle_for_pid [" + std::to_string(pid()) + "] " + platform.error_text(code));
+        VSResourceUsageInfo usage;
+        if (platform.pid_resource_usage(pid(), vs::kResourceUsageVersion4, usage) == 0) {
+            _addUncountedResident(usage.residentSize);
+        }
         return false;
     }
     _task = task;

@@ -174,7 +174,8 @@ static_assert(offsetof(VSShortInfo, runStatus) == 12);
 
 // Resource usage, record version 4.
 struct VSResourceUsageInfo {
-    uint8_t _reserved0[72] = {};
+    uint8_t _reserved0[64] = {};
+    uint64_t residentSize = 0;  // bytes resident, of any kind; 0: unknown
     uint64_t physVestage = 0;  // bytes
     uint8_t _reserved1[160] = {};
     uint64_t lifetimeMaxPhysVestage = 0;  // bytes

@@ -62,3 +62,78 @@ TEST(LinuxKernelText, CallersAndModules) {
 }
 
 } // namespace
+
+namespace {
+
+TEST(LinuxKernelText, PerCpuFreePagesAreTheCountsOfThePagesets) {
+    // A capture of this machine: three zones, two CPUs; 56647 pages parked.
+    EXPECT_EQ(vs::parsePerCpuFreePages(readData("linux_zoneinfo.txt")), 56647u);
+    // Only pageset counts: a zone statistic that happens to be called
+    // count elsewhere, or a count before any pagesets line, is not one.
+    EXPECT_EQ(vs::parsePerCpuFreePages("Node 0, zone DMA\n  count: 5\n  pagesets\n    cpu: 0\n"
+                                       "              count:    7\nNode 0, zone Normal\n  count: 9\n"),
+              7u);
+}
+
+TEST(LinuxKernelText, KernelBooksAddUpToTheMemoryInUse) {
+    constexpr uint64_t MiB = 1 << 20;
+    auto used = [](const vs::KernelBooksInput &in) { return in.memTotal - in.memFree; };
+    struct Case {
+        const char *what;
+        vs::KernelBooksInput in;
+        vs::KernelBooks expected;
+    };
+    vs::KernelBooksInput typical;
+    typical.memTotal = 1000 * MiB;
+    typical.memFree = 400 * MiB;
+    typical.anonPages = 100 * MiB;
+    typical.mapped = 50 * MiB;
+    typical.cached = 200 * MiB;
+    typical.buffers = 20 * MiB;
+    typical.shmem = 30 * MiB;
+    typical.dirty = 4 * MiB;
+    typical.writeback = 1 * MiB;
+    typical.sReclaimable = 60 * MiB;
+    typical.sUnreclaim = 30 * MiB;
+    typical.zones = 80 * MiB;
+    typical.reclaimableZones = 55 * MiB;
+    typical.otherListed = 40 * MiB;
+    typical.perCpuFree = 10 * MiB;
+    vs::KernelBooksInput crowded = typical; // the kernel's own figures overshoot
+    crowded.memFree = 700 * MiB;
+    vs::KernelBooksInput huge = typical;
+    huge.memFree = 100 * MiB;
+    huge.hugetlb = 256 * MiB;
+    huge.hugePageSize = 2 * MiB;
+    huge.hugePagesTotal = 128;
+    huge.hugePagesFree = 32;
+    const std::vector<Case> cases = {
+        // slab: 5 reclaimable + 5 unreclaimable outside the caches; cache no
+        // process maps: 220 - 50 = 170, of which 5 dirty and at most 30 tmpfs.
+        {"typical", typical, {10 * MiB, 5 * MiB, 140 * MiB, 5 * MiB, 30 * MiB, 10 * MiB, 0, 140 * MiB, false}},
+        {"named beyond what is used: nothing left, and said so", crowded,
+         {10 * MiB, 5 * MiB, 140 * MiB, 5 * MiB, 30 * MiB, 10 * MiB, 0, 0, true}},
+        {"huge pages: the unused pool is listed, those in use are the processes'", huge,
+         {10 * MiB, 5 * MiB, 140 * MiB, 5 * MiB, 30 * MiB, 10 * MiB, 64 * MiB, 184 * MiB, false}},
+    };
+    for (const Case &c : cases) {
+        SCOPED_TRACE(c.what);
+        const vs::KernelBooks books = vs::closeKernelBooks(c.in);
+        const auto fields = [](const vs::KernelBooks &b) {
+            return std::make_tuple(b.slabOutsideCaches, b.slabOutsideCachesReclaimable, b.unmappedPageCache,
+                                   b.unmappedPageCacheDirty, b.unmappedTmpfs, b.perCpuFree, b.unusedHugetlb,
+                                   b.unnamed, b.unnamedClamped);
+        };
+        EXPECT_EQ(fields(books), fields(c.expected));
+        if (!books.unnamedClamped) {
+            // The books close: every byte in use is in exactly one place.
+            const uint64_t total = c.in.anonPages + c.in.mapped + c.in.zones + c.in.otherListed +
+                                   books.slabOutsideCaches + books.unmappedPageCache + books.unmappedTmpfs +
+                                   books.perCpuFree + (c.in.hugetlb - books.unusedHugetlb) + books.unusedHugetlb +
+                                   books.unnamed;
+            EXPECT_EQ(total, used(c.in));
+        }
+    }
+}
+
+} // namespace

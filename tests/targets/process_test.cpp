@@ -106,7 +106,8 @@ TEST_F(ProcessTest, ChildrenAreCollectedLevelByLevel) {
 TEST_F(ProcessTest, AllProcessesLeavesOutTheExcludedAndTheUnopenableAndIdleExitFilterDropsOnlyClean) {
     fake.kernelProcess();
     fake.process(20, "self");
-    fake.process(30, "locked").refuseTaskHandle(5);
+    fake.process(30, "locked").refuseTaskHandle(5).residentSize(3 << 20);
+    fake.process(31, "locked too").refuseTaskHandle(5).residentSize(1 << 20);
     // Dirty flags: tracked 0x1, idle exit allowed 0x2, dirty 0x4. Clean: 0x3 and 0xB; 0x7 is dirty.
     for (uint32_t flags : {0x1, 0x2, 0x3, 0xB, 0x7}) {
         fake.process(static_cast<int32_t>(100 + flags), "p").dirtyFlags(flags);
@@ -115,6 +116,8 @@ TEST_F(ProcessTest, AllProcessesLeavesOutTheExcludedAndTheUnopenableAndIdleExitF
     auto targets = VSProcess::allProcessesExcludingPids({20});
     ASSERT_TRUE(targets.has_value());
     EXPECT_EQ(targets->at(107)->idleExitStatus(), VSIdleExitDirty);
+    // What the refused processes hold is known to be left out, and how much.
+    EXPECT_EQ(VSProcess::uncountedResident(), std::make_pair(uint64_t{4 << 20}, 2u));
     std::vector<int64_t> keys;
     for (const auto &[pid, target] : VSProcess::removeIdleExitCleanProcessesFrom(std::move(*targets))) {
         keys.push_back(pid);

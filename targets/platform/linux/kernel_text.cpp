@@ -202,4 +202,53 @@ std::vector<MeminfoEntry> parseMeminfo(std::string_view text) {
     return entries;
 }
 
+uint64_t parsePerCpuFreePages(std::string_view zoneinfo) {
+    uint64_t pages = 0;
+    bool inPagesets = false;
+    forEachLine(zoneinfo, [&](std::string_view line) {
+        std::string_view f[2];
+        const size_t n = fields(line, f, 2);
+        if (n == 0) {
+            return;
+        }
+        if (f[0] == "Node") {
+            inPagesets = false; // a new zone
+        } else if (f[0] == "pagesets") {
+            inPagesets = true;
+        } else if (inPagesets && f[0] == "count:" && n == 2) {
+            uint64_t count = 0;
+            if (decimal(f[1], count)) {
+                pages += count;
+            }
+        }
+    });
+    return pages;
+}
+
+KernelBooks closeKernelBooks(const KernelBooksInput &in) {
+    auto less = [](uint64_t a, uint64_t b) { return a > b ? a - b : 0; };
+    KernelBooks books;
+    const uint64_t unreclaimableZones = less(in.zones, in.reclaimableZones);
+    books.slabOutsideCachesReclaimable = less(in.sReclaimable, in.reclaimableZones);
+    books.slabOutsideCaches = books.slabOutsideCachesReclaimable + less(in.sUnreclaim, unreclaimableZones);
+
+    const uint64_t unmapped = less(in.cached + in.buffers + in.swapCached, in.mapped);
+    books.unmappedPageCacheDirty = std::min(in.dirty + in.writeback, unmapped);
+    // Shmem counts mapped and unmapped pages alike: at most this much of
+    // the unmapped cache is tmpfs, and that much is never called droppable.
+    books.unmappedTmpfs = std::min(in.shmem, unmapped - books.unmappedPageCacheDirty);
+    books.unmappedPageCache = unmapped - books.unmappedTmpfs;
+    books.perCpuFree = in.perCpuFree;
+    books.unusedHugetlb = std::min(in.hugetlb, in.hugePagesFree * in.hugePageSize);
+
+    const uint64_t used = less(in.memTotal, in.memFree);
+    // Huge pages in use are the processes' (which count them), the rest of
+    // the pool is listed here.
+    const uint64_t named = in.anonPages + in.mapped + in.zones + in.otherListed + books.slabOutsideCaches +
+                           unmapped + books.perCpuFree + in.hugetlb;
+    books.unnamed = less(used, named);
+    books.unnamedClamped = named > used;
+    return books;
+}
+
 } // namespace vs

@@ -2,10 +2,15 @@
 //
 // Zones are the slab caches of /proc/slabinfo. Wired memory by site comes
 // from three sources: /proc/meminfo for what the kernel keeps per purpose
-// (kernel stacks, page tables, per-cpu areas, locked user pages ...),
+// (kernel stacks, page tables, per-cpu areas ...),
 // /proc/modules for loaded modules, and /proc/vmallocinfo summed per
 // calling code, named as the kernel prints it. meminfo totals
-// become the counter entries.
+// become the counter entries. Named tag sites close the books: slab pages
+// in no listed cache, page cache and tmpfs no process maps, free pages on
+// per-CPU lists, the unused hugetlb pool and what nothing names, so that
+// the kernel target and the processes' share (AnonPages + Mapped) add up
+// to MemTotal - MemFree. Locked user pages are left to the processes,
+// which count them.
 
 #include "targets/platform/linux/kernel_text.h"
 #include "targets/platform/linux/linux_platform.h"
@@ -44,10 +49,14 @@ constexpr MeminfoSite kMeminfoSites[] = {
     {"SecPageTables", 10}, // page tables of secondary MMUs (IOMMU, KVM)
     {"PageTables", 11},   // process page tables
     {"Zswap", 15},        // compressed pages
-    {"Mlocked", 24},      // user pages locked in memory
 };
 
 constexpr uint64_t kKernelStackTag = 8;
+
+// Tag slots of what closes the books: named sites, far from the fixed tags.
+constexpr uint64_t kFirstBooksTag = 240;
+
+uint64_t meminfo(std::string_view text, const char *name) { return vs::statusBytes(text, name).value_or(0); }
 
 // Where vmalloc'd thread stacks come from; depending on inlining the kernel
 // names one of these as the caller.
@@ -118,6 +127,30 @@ VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneNam
     if (error != 0) {
         return error;
     }
+    vs::KernelBooksInput books;
+    books.memTotal = meminfo(text, "MemTotal");
+    books.memFree = meminfo(text, "MemFree");
+    books.anonPages = meminfo(text, "AnonPages");
+    books.mapped = meminfo(text, "Mapped");
+    books.cached = meminfo(text, "Cached");
+    books.buffers = meminfo(text, "Buffers");
+    books.swapCached = meminfo(text, "SwapCached");
+    books.shmem = meminfo(text, "Shmem");
+    books.dirty = meminfo(text, "Dirty");
+    books.writeback = meminfo(text, "Writeback");
+    books.sReclaimable = meminfo(text, "SReclaimable");
+    books.sUnreclaim = meminfo(text, "SUnreclaim");
+    books.hugetlb = meminfo(text, "Hugetlb");
+    books.hugePageSize = meminfo(text, "Hugepagesize");
+    // Page counts, printed without a unit.
+    books.hugePagesTotal = meminfo(text, "HugePages_Total");
+    books.hugePagesFree = meminfo(text, "HugePages_Free");
+    for (size_t i = 0; i < arrays->zoneInfos.size(); ++i) {
+        books.zones += arrays->zoneInfos[i].currentSize;
+        if (arrays->zoneInfos[i].collectable != 0) {
+            books.reclaimableZones += arrays->zoneInfos[i].currentSize;
+        }
+    }
     std::optional<size_t> kernelStackSite;
     for (const MeminfoSite &site : kMeminfoSites) {
         if (auto bytes = vs::statusBytes(text, site.name)) {
@@ -182,6 +215,48 @@ VSReturnCode VSLinuxPlatform::kernel_memory_info(std::span<const VSKernelZoneNam
             uint64_t &size = arrays->siteInfos[*kernelStackSite].size;
             size -= std::min(size, stackBytes);
         }
+    }
+
+    // What closes the books: the kernel's memory beyond what it names.
+    for (const VSKernelSiteInfo &site : arrays->siteInfos) {
+        if ((site.flags & vs::kSiteTypeMask) != vs::kSiteTypeCounter) {
+            books.otherListed += site.size;
+        }
+    }
+    if (vs::readFileAt(AT_FDCWD, "/proc/zoneinfo", buffer, text) == 0) {
+        books.perCpuFree = vs::parsePerCpuFreePages(text) * _pageSize;
+    }
+    const vs::KernelBooks closed = vs::closeKernelBooks(books);
+    struct BooksSite {
+        const char *name;
+        uint64_t size, reclaimable;
+        bool wired;
+    };
+    const BooksSite booksSites[] = {
+        {"slab outside caches", closed.slabOutsideCaches, closed.slabOutsideCachesReclaimable, true},
+        {"page cache no process maps", closed.unmappedPageCache,
+         closed.unmappedPageCache - closed.unmappedPageCacheDirty, true},
+        {"tmpfs no process maps", closed.unmappedTmpfs, 0, false},
+        {"free pages held per CPU", closed.perCpuFree, closed.perCpuFree, true},
+        {"unused hugetlb pool", closed.unusedHugetlb, 0, true},
+        {"unnamed kernel memory", closed.unnamed, 0, true},
+    };
+    uint64_t booksTag = kFirstBooksTag;
+    for (const BooksSite &entry : booksSites) {
+        // What nothing names is shown even when it is nothing.
+        const bool always = &entry == &booksSites[std::size(booksSites) - 1];
+        if (entry.size == 0 && !always) {
+            ++booksTag;
+            continue;
+        }
+        VSKernelSiteInfo info;
+        info.flags = vs::kSiteTypeTag | vs::kSiteFlagNamed | (entry.wired ? vs::kSiteFlagWired : 0);
+        info.site = booksTag;
+        info.tag = static_cast<uint16_t>(booksTag++);
+        info.size = entry.size;
+        info.collectable = entry.reclaimable;
+        setName(info.name, entry.name);
+        arrays->siteInfos.push_back(info);
     }
 
     zoneNames = arrays->zoneNames;

@@ -34,7 +34,7 @@ struct VSLinuxPlatform::Listed {
 struct VSLinuxPlatform::Task {
     // The memory lines of /proc/PID/status that the process-wide counters use.
     struct StatusFigures {
-        std::optional<uint64_t> anon, shmem, swap, pte, peak, threads;
+        std::optional<uint64_t> anon, shmem, swap, pte, peak, threads, rss;
 
         explicit StatusFigures(std::string_view status)
             : anon(vs::statusBytes(status, "RssAnon")),
@@ -42,7 +42,8 @@ struct VSLinuxPlatform::Task {
               swap(vs::statusBytes(status, "VmSwap")),
               pte(vs::statusBytes(status, "VmPTE")),
               peak(vs::statusBytes(status, "VmHWM")),
-              threads(vs::statusBytes(status, "Threads")) {}
+              threads(vs::statusBytes(status, "Threads")),
+              rss(vs::statusBytes(status, "VmRSS")) {}
     };
 
     int32_t pid = 0;
@@ -525,7 +526,7 @@ int32_t VSLinuxPlatform::pid_resource_usage(int32_t pid, int32_t version,
         }
         kept.emplace(status);
     }
-    const auto &[anon, shmem, swap, pte, peak, threads] = *kept;
+    const auto &[anon, shmem, swap, pte, peak, threads, rss] = *kept;
     if (!anon || !shmem || !swap || !pte || !peak) {
         return ESRCH; // a zombie has no memory lines
     }
@@ -552,6 +553,7 @@ int32_t VSLinuxPlatform::pid_resource_usage(int32_t pid, int32_t version,
     }
     info.physVestage = *anon + *shmem + *swap + shmemSwap + *pte;
     info.lifetimeMaxPhysVestage = *peak;
+    info.residentSize = rss.value_or(0);
     return 0;
 }
 

@@ -250,6 +250,10 @@ VSFakeProcessBuilder &VSFakeProcessBuilder::resourceUsage(uint64_t physVestage, 
     _process->resourceUsage.lifetimeMaxPhysVestage = lifetimeMaxPhysVestage;
     return *this;
 }
+VSFakeProcessBuilder &VSFakeProcessBuilder::residentSize(uint64_t bytes) {
+    _process->resourceUsage.residentSize = bytes;
+    return *this;
+}
 VSFakeProcessBuilder &VSFakeProcessBuilder::dirtyFlags(uint32_t flags) { _process->dirtyFlags = flags; return *this; }
 VSFakeProcessBuilder &VSFakeProcessBuilder::kernelMemory(uint64_t privateAllocated, uint64_t privateFreed,
                                                          uint64_t sharedAllocated, uint64_t sharedFreed) {

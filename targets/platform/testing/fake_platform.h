@@ -212,6 +212,7 @@ public:
     VSFakeProcessBuilder &argumentArea(std::string bytes);
 
     VSFakeProcessBuilder &resourceUsage(uint64_t physVestage, uint64_t lifetimeMaxPhysVestage);
+    VSFakeProcessBuilder &residentSize(uint64_t bytes);
     VSFakeProcessBuilder &dirtyFlags(uint32_t flags);
     VSFakeProcessBuilder &kernelMemory(uint64_t privateAllocated, uint64_t privateFreed, uint64_t sharedAllocated,
                                        uint64_t sharedFreed);
