@@ -70,6 +70,8 @@ void printUsage(FILE *out) {
     putLine(out, "\t-w, --wide\t\t\t\tshow wide output with all columns (implies --swapped --wired)");
     putLine(out, "\t--swapped\t\t\t\tshow swapped/compressed column");
     putLine(out, "\t--wired\t\t\t\t\tshow wired column");
+    putLine(out, "\t-j -, --json -\t\t\t\twrite the json document to standard output instead of the text report");
+    putLine(out, "\t--version\t\t\t\tprint the version and exit");
 }
 
 void printCorpseUsage(FILE *out) {
@@ -132,6 +134,13 @@ OptionScanResult scanOptions(int argc, char **argv, FILE *out, FILE *err) {
         options.pidTable[pid] = std::nullopt;
         return true;
     };
+
+    // --version is not one of getopt's long options: with it, "--v" would
+    // abbreviate it instead of being the unknown option it always was.
+    if (argc >= 2 && std::strcmp(argv[1], "--version") == 0) {
+        std::fprintf(out, "vestage %s\n", VESTAGE_VERSION);
+        return fail(0);
+    }
 
     // 0 makes glibc forget the previous scan entirely (including a
     // half-read group of short options).
@@ -212,6 +221,7 @@ OptionScanResult scanOptions(int argc, char **argv, FILE *out, FILE *err) {
         case OptionWired:
             options.outputOptions |= VSOutputOptionWired;
             break;
+
         default:
             // '?' or ':' after getopt_long's own diagnostic, or a value
             // no branch above knows.

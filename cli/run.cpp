@@ -180,7 +180,11 @@ int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArgum
         std::signal(SIGINT, SIG_DFL);
     }
 
-    vestage.addOutputFormatter(std::make_unique<VSOutputFormatterText>(options.summaryFormat, options.outputOptions));
+    // "--json -": the document goes to standard output in place of the text.
+    if (!options.jsonPath || *options.jsonPath != "-") {
+        vestage.addOutputFormatter(
+            std::make_unique<VSOutputFormatterText>(options.summaryFormat, options.outputOptions));
+    }
     if (options.jsonPath) {
         vestage.addOutputFormatter(std::make_unique<VSOutputFormatterJSON>(*options.jsonPath));
     }

@@ -182,6 +182,12 @@ void VSOutputFormatterJSON::end() {
         reportWriteFailure(exception.what());
         return;
     }
+    if (_path == "-") {
+        // The document is the report: a failed write is the run's to see.
+        document += '\n';
+        std::fwrite(document.data(), 1, document.size(), stdout);
+        return;
+    }
     try {
         if (std::optional<vs::FileFailure> failure = vs::writeOutputFile(_path, document, 0644)) {
             reportWriteFailure(failure->reason);

@@ -3,7 +3,11 @@
 # Not root and something missing: print the one apt-get line to run and stop.
 set -euo pipefail
 
-packages=(g++ make cmake pkg-config libbsd-dev nlohmann-json3-dev googletest libgtest-dev)
+# `setup.sh tests` adds what the tests need.
+packages=(g++ make cmake pkg-config libbsd-dev nlohmann-json3-dev)
+if [ "${1:-}" = tests ]; then
+    packages+=(googletest libgtest-dev)
+fi
 
 missing=()
 for p in "${packages[@]}"; do

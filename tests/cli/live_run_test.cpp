@@ -156,6 +156,20 @@ TEST(LiveRun, SharingAfterForkUnresolvedWithoutRootIsSaid) {
     EXPECT_EQ(document.value("notes", nlohmann::json::array()), nlohmann::json::array({note}));
 }
 
+// "--json -": the document on standard output, and nothing else there.
+TEST(LiveRun, JsonOnStandardOutputIsTheWholeOutput) {
+    if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";
+    MemChild child({"anon:a:4:4"});
+    ASSERT_TRUE(child.ready());
+    vs::test::ScratchDir dir;
+    const auto run = runProgram({"-p", std::to_string(child.pid()), "--json", "-"}, {.workingDirectory = dir.path});
+    ASSERT_EQ(run.status, 0) << run.err;
+    const nlohmann::json document = nlohmann::json::parse(run.out, nullptr, false);
+    ASSERT_FALSE(document.is_discarded()) << run.out;
+    EXPECT_EQ(document.at("processes").at(0).at("pid"), child.pid());
+    EXPECT_FALSE(std::filesystem::exists(dir.path + "/-")) << "no file named -";
+}
+
 // A report that cannot be written whole is an error, not a success.
 TEST(LiveRun, ReportThatCannotBeWrittenFailsTheRun) {
     if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";

@@ -23,7 +23,9 @@ const char *const kUsage =
     "regions\n"
     "\t-w, --wide\t\t\t\tshow wide output with all columns (implies --swapped --wired)\n"
     "\t--swapped\t\t\t\tshow swapped/compressed column\n"
-    "\t--wired\t\t\t\t\tshow wired column\n";
+    "\t--wired\t\t\t\t\tshow wired column\n"
+    "\t-j -, --json -\t\t\t\twrite the json document to standard output instead of the text report\n"
+    "\t--version\t\t\t\tprint the version and exit\n";
 
 const char *const kCorpseUsage =
     "Usage: vestage --corpsePid pid --corpseName name --corpseDirtyFlags dirtyFlags --corpseProcFlags procFlags\n"
@@ -48,6 +50,8 @@ TEST(ProgramRun, OptionScanAndTargetOutcomes) {
     } cases[] = {
         // Help wins only if it is reached.
         {{"--he"}, usage, "", 0},
+        {{"--version"}, "vestage 0.1\n", "", 0},
+        {{"--vers"}, usage, "vestage: unrecognized option '--vers'\n", 1},
         {{"-h", "-f", "Formatted"}, usage, "", 0},
         {{"-f", "Formatted", "-h"}, "", kBadFormat, 1},
         {{"--format=Bytes"}, "", kBadFormat, 1},
