@@ -326,26 +326,64 @@ std::optional<VSPidTable> VSProcess::pidsForStringDescriptions(const std::vector
     // description.
     std::vector<std::optional<std::string>> names(snapshot->size());
     VSPidTable result;
+    VSPlatform &platform = VSPlatform::current();
+    auto isZombie = [&](int32_t pid) {
+        VSShortInfo info;
+        int32_t errorNumber = 0;
+        return platform.pid_short_info(pid, info, errorNumber) == static_cast<int32_t>(sizeof(VSShortInfo)) &&
+               info.runStatus == vs::kRunStatusZombie;
+    };
     for (const std::string &description : descriptions) {
         const std::optional<int64_t> number = scanInteger(description);
-        bool matched = false;
-        for (size_t i = 0; i < snapshot->size() && !matched; ++i) {
+        // Every record the description names, by name or as a number.
+        std::vector<std::pair<int32_t, bool>> matches; // pid, by name
+        for (size_t i = 0; i < snapshot->size(); ++i) {
             const VSBsdInfo &info = (*snapshot)[i];
             const auto pid = static_cast<int32_t>(info.pid);
             if (!names[i]) {
                 names[i] = _nameForBsdInfo(info);
             }
             if (*names[i] == description) {
-                result[pid] = description;
-                matched = true;
+                matches.emplace_back(pid, true);
             } else if (number && *number == pid) {
-                result[pid] = std::nullopt;
-                matched = true;
+                matches.emplace_back(pid, false);
             }
         }
-        if (!matched && errors) {
-            errors->push_back("Unable to find pid for process matching '" + description + "'");
+        if (matches.empty()) {
+            if (errors) {
+                errors->push_back("Unable to find pid for process matching '" + description + "'");
+            }
+            continue;
         }
+        // The first match, unless it is a zombie and a live process matches
+        // too: a zombie has no memory left to show.
+        size_t chosen = 0;
+        const auto byName = std::count_if(matches.begin(), matches.end(), [](const auto &m) { return m.second; });
+        if (byName > 1) {
+            for (size_t i = 0; i < matches.size(); ++i) {
+                if (matches[i].second && !isZombie(matches[i].first)) {
+                    chosen = i;
+                    break;
+                }
+            }
+            if (errors) {
+                std::string others;
+                size_t listed = 0;
+                for (size_t i = 0; i < matches.size(); ++i) {
+                    if (i != chosen && matches[i].second && listed++ < 8) {
+                        others += (others.empty() ? "" : ", ") + std::to_string(matches[i].first);
+                    }
+                }
+                if (byName - 1 > 8) {
+                    others += ", ...";
+                }
+                errors->push_back("'" + description + "' matches " + std::to_string(byName) +
+                                  " processes; analysing " + std::to_string(matches[chosen].first) +
+                                  "; pick another with --pid: " + others);
+            }
+        }
+        const auto [pid, named] = matches[chosen];
+        result[pid] = named ? std::optional<std::string>(description) : std::nullopt;
     }
     return result;
 }

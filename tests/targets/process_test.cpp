@@ -61,13 +61,22 @@ TEST_F(ProcessTest, DescriptionsResolveByNameFirstThenByNumber) {
              {1, "init"}, {5, "123"}, {123, "worker"}, {42, "server"}, {43, "server"}, {50, "-7"}}) {
         fake.process(pid, name);
     }
+    // A zombie listed first, then two live ones of the same name.
+    fake.process(60, "python3").zombie();
+    fake.process(61, "python3");
+    fake.process(62, "python3");
     const std::string none = "Unable to find pid for process matching ";
     const std::vector<std::tuple<std::vector<std::string>, VSPidTable, std::vector<std::string>>> cases = {
         {{"worker"}, {{123, "worker"}}, {}},
         {{"123"}, {{5, "123"}}, {}},  // a name listed earlier beats the pid
         {{" 42"}, {{42, std::nullopt}}, {}}, {{"+42"}, {{42, std::nullopt}}, {}}, {{"42abc"}, {{42, std::nullopt}}, {}},
         {{"x42"}, {}, {none + "'x42'"}}, {{"-42"}, {}, {none + "'-42'"}}, {{"-7"}, {{50, "-7"}}, {}},
-        {{"work"}, {}, {none + "'work'"}}, {{"server"}, {{42, "server"}}, {}},  // the first of two with that name
+        {{"work"}, {}, {none + "'work'"}},
+        // The first of two with that name, and a word on the other.
+        {{"server"}, {{42, "server"}}, {"'server' matches 2 processes; analysing 42; pick another with --pid: 43"}},
+        // A zombie has nothing left to show while a live one matches.
+        {{"python3"}, {{61, "python3"}},
+         {"'python3' matches 3 processes; analysing 61; pick another with --pid: 60, 62"}},
         {{"init", "1"}, {{1, std::nullopt}}, {}}, {{"1", "init"}, {{1, "init"}}, {}},
         {{"nope", "worker", ""}, {{123, "worker"}}, {none + "'nope'", none + "''"}},
     };
