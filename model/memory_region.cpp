@@ -287,3 +287,20 @@ std::optional<std::string> dynamicTagName(std::uint32_t tag) {
 }
 
 } // namespace vs
+
+std::string VSMemoryRegion::sharedMemoryCategoryName(std::string_view path) {
+    constexpr std::string_view kDeleted = " (deleted)";
+    if (path.size() > kDeleted.size() && path.substr(path.size() - kDeleted.size()) == kDeleted) {
+        path.remove_suffix(kDeleted.size());
+    }
+    std::string name = "shared memory ";
+    if (path.rfind("/memfd:", 0) == 0) {
+        name += path.substr(1);
+    } else if (path.rfind("/SYSV", 0) == 0 && path.size() == 13) {
+        // SysV segments are named after their key.
+        name += std::string(path.substr(1)) + " (key 0x" + std::string(path.substr(5)) + ")";
+    } else {
+        name += path;
+    }
+    return name;
+}

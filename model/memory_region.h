@@ -126,6 +126,10 @@ public:
     // registered at run time (vs::registerDynamicTagName) before falling
     // back to "tag %d".
     static std::optional<std::string> categoryNameForTag(std::uint32_t tag);
+    // The category of named shared memory at `path` as the kernel shows it:
+    // "shared memory /dev/shm/NAME", "shared memory memfd:NAME",
+    // "shared memory SYSV0000002a (key 0x0000002a)".
+    static std::string sharedMemoryCategoryName(std::string_view path);
 
 private:
     VSMemoryObject *_memoryObject = nullptr;
@@ -165,6 +169,12 @@ inline constexpr std::uint32_t kTagMemfd = 43;              // "memfd"
 inline constexpr std::uint32_t kTagSysVSharedMemory = 44;   // "SysV shared memory"
 inline constexpr std::uint32_t kTagPosixSharedMemory = 45;  // "POSIX shared memory"
 inline constexpr std::uint32_t kTagDevZero = 46;            // "/dev/zero mapping"
+
+// Shared memory that users create by name (tmpfs and /dev/shm files, memfd,
+// SysV segments) is shown under that name.
+inline bool isNamedSharedMemoryTag(std::uint32_t tag) {
+    return tag == kTagSharedMemory || tag == kTagMemfd || tag == kTagSysVSharedMemory || tag == kTagPosixSharedMemory;
+}
 inline constexpr std::uint32_t kTagHugetlb = 83;            // "hugetlbfs"
 inline constexpr std::uint32_t kTagUprobes = 86;            // "uprobes"
 

@@ -166,6 +166,9 @@ std::optional<VSHeapfileSnapshot> snapshotOf(VSCapturingProcess &process, const 
         if (walked.image != nullptr && walked.image->name()) {
             region.type = *walked.image->name();
             region.path = walked.image->ownerPath();
+        } else if (walked.path && isNamedSharedMemoryTag(info.userTag)) {
+            region.type = VSMemoryRegion::sharedMemoryCategoryName(*walked.path);
+            region.path = walked.path;
         } else if (walked.path || info.externalPager != 0) {
             region.type = "mapped file";
             region.path = walked.path;

@@ -160,7 +160,8 @@ void VSHeapfileProcess::enumerateRegions(const RegionCallback &callback) {
         }
         // A file's pages show its path; so do the copies a private mapping
         // made of them, which the capture wrote as a mapped file too.
-        const bool showsPath = region.externalPager != 0 || region.type == "mapped file";
+        const bool showsPath = region.externalPager != 0 || region.type == "mapped file" ||
+                               vs::isNamedSharedMemoryTag(info.userTag);
         const std::optional<std::string> path = showsPath ? region.path : std::nullopt;
         stop = callback(region.address, region.length, info, region.purgeableState, path);
     });

@@ -270,6 +270,9 @@ void VSUserProcess::_gatherMemoryData() {
             region->setSharedName(names->second.first);
             region->setSharedDetailedName(names->second.second);
             region->setSegment(image->segment());
+        } else if (path && vs::isNamedSharedMemoryTag(info.userTag)) {
+            region->setSharedName(vs::internedString(VSMemoryRegion::sharedMemoryCategoryName(*path)));
+            region->setSharedDetailedName(vs::internedString(*path));
         } else if (path || info.externalPager != 0) {
             region->setSharedName(mappedFileName);
             region->setSharedDetailedName(path ? vs::internedString(*path) : nullptr);
@@ -422,7 +425,7 @@ void VSUserProcess::enumerateRegions(const RegionCallback &callback) {
         if (info.userTag == kAllOnesTag) {
             seenAllOnesTag = true;
         }
-        if (info.externalPager != 0 && _isAlive()) {
+        if ((info.externalPager != 0 || vs::isNamedSharedMemoryTag(info.userTag)) && _isAlive()) {
             char buffer[vs::kRegionFilenameBufferSize];
             const int32_t length = platform.pid_region_filename(pid(), address, buffer);
             if (length > 0) {

@@ -156,6 +156,32 @@ TEST(LiveRun, SharingAfterForkUnresolvedWithoutRootIsSaid) {
     EXPECT_EQ(document.value("notes", nlohmann::json::array()), nlohmann::json::array({note}));
 }
 
+// Shared memory that users create by name is shown under that name, in the
+// text report and the JSON document alike.
+TEST(LiveRun, NamedSharedMemoryIsShownByItsName) {
+    if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";
+    const std::string shm = "vs_live_test_pool_" + std::to_string(getpid());
+    MemChild child({"shm:p:" + shm + ":2", "memfd:m:ring:3", "sysv:s:4"});
+    ASSERT_TRUE(child.ready());
+    vs::test::ScratchDir dir;
+    const auto run = runProgram({"-f", "bytes", "-p", std::to_string(child.pid()), "--json", dir.path + "/r.json"});
+    ASSERT_EQ(run.status, 0) << run.err;
+    std::ifstream in(dir.path + "/r.json");
+    const nlohmann::json document = nlohmann::json::parse(in, nullptr, false);
+    ASSERT_FALSE(document.is_discarded());
+    const auto &categories = document.at("processes").at(0).at("categories");
+    const std::pair<std::string, uint64_t> expected[] = {
+        {"shared memory /dev/shm/" + shm, 2 * kPage},
+        {"shared memory memfd:ring", 3 * kPage},
+        {"shared memory SYSV00000000 (key 0x00000000)", 4 * kPage},
+    };
+    for (const auto &[name, dirty] : expected) {
+        EXPECT_EQ(dirtyIn(run.out, "vs_memchild", name), dirty) << name << "\n" << run.out;
+        ASSERT_TRUE(categories.contains(name)) << name;
+    }
+    unlink(("/dev/shm/" + shm).c_str());
+}
+
 // "--json -": the document on standard output, and nothing else there.
 TEST(LiveRun, JsonOnStandardOutputIsTheWholeOutput) {
     if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";

@@ -15,6 +15,10 @@
 //   sfile:LABEL:PATH             PATH mapped shared and writable, untouched
 //   shm:LABEL:NAME:PAGES         a POSIX shared memory object /dev/shm/NAME
 //                                mapped shared, every page written
+//   memfd:LABEL:NAME:PAGES       a memfd named NAME mapped shared, every page
+//                                written
+//   sysv:LABEL:PAGES             a private SysV segment attached, every page
+//                                written (removed at once, so it goes with us)
 //   mlock:LABEL:PAGES            anonymous memory written and locked
 //   free:LABEL:PAGES:FREED       anonymous memory written, then the first
 //                                FREED pages given back with MADV_FREE (and
@@ -51,6 +55,7 @@
 #include <pthread.h>
 #include <string>
 #include <sys/mman.h>
+#include <sys/shm.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -283,6 +288,31 @@ int main(int argc, char **argv) {
             close(fd);
             touch(static_cast<char *>(start), pages);
             gSharedItems.push_back({static_cast<char *>(start), pages});
+            remember(label, start, pages);
+            printRegion(label, start, pages);
+        } else if (kind == "memfd" && item.size() == 4) {
+            const size_t pages = number(item[3]);
+            const int fd = memfd_create(item[2].c_str(), MFD_CLOEXEC);
+            if (fd < 0 || ftruncate(fd, static_cast<off_t>(pages * kPage)) != 0) {
+                fail("memfd " + item[2]);
+            }
+            void *start = mmap(nullptr, pages * kPage, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
+            if (start == MAP_FAILED) {
+                fail("mmap memfd");
+            }
+            close(fd);
+            touch(static_cast<char *>(start), pages);
+            remember(label, start, pages);
+            printRegion(label, start, pages);
+        } else if (kind == "sysv" && item.size() == 3) {
+            const size_t pages = number(item[2]);
+            const int id = shmget(IPC_PRIVATE, pages * kPage, IPC_CREAT | 0600);
+            void *start = id < 0 ? reinterpret_cast<void *>(-1) : shmat(id, nullptr, 0);
+            if (start == reinterpret_cast<void *>(-1)) {
+                fail("shmget");
+            }
+            shmctl(id, IPC_RMID, nullptr);
+            touch(static_cast<char *>(start), pages);
             remember(label, start, pages);
             printRegion(label, start, pages);
         } else if (kind == "mlock" && item.size() == 3) {
