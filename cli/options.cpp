@@ -16,6 +16,7 @@ enum : int {
     OptionPhysVestage = 260,
     OptionSwapped = 261,
     OptionWired = 262,
+    OptionTop = 263,
 };
 
 void putLine(FILE *out, const char *line) {
@@ -71,6 +72,7 @@ void printUsage(FILE *out) {
     putLine(out, "\t--swapped\t\t\t\tshow swapped/compressed column");
     putLine(out, "\t--wired\t\t\t\t\tshow wired column");
     putLine(out, "\t-j -, --json -\t\t\t\twrite the json document to standard output instead of the text report");
+    putLine(out, "\t--top[=N]\t\t\t\tone line per process, largest vestage first (default: 20 lines)");
     putLine(out, "\t--version\t\t\t\tprint the version and exit");
 }
 
@@ -111,6 +113,7 @@ OptionScanResult scanOptions(int argc, char **argv, FILE *out, FILE *err) {
         {"wide", no_argument, nullptr, 'w'},
         {"swapped", no_argument, nullptr, OptionSwapped},
         {"wired", no_argument, nullptr, OptionWired},
+        {"top", optional_argument, nullptr, OptionTop},
         {nullptr, 0, nullptr, 0},
     };
 
@@ -221,6 +224,17 @@ OptionScanResult scanOptions(int argc, char **argv, FILE *out, FILE *err) {
         case OptionWired:
             options.outputOptions |= VSOutputOptionWired;
             break;
+        case OptionTop: {
+            constexpr std::size_t kDefaultTopLines = 20;
+            char *end = nullptr;
+            const long lines = optarg ? std::strtol(optarg, &end, 10) : static_cast<long>(kDefaultTopLines);
+            if (optarg && (end == optarg || *end != '\0' || lines < 1)) {
+                std::fprintf(err, "--top wants a number of lines above 0, not '%s'.\n", optarg);
+                return fail(1);
+            }
+            options.top = static_cast<std::size_t>(lines);
+            break;
+        }
 
         default:
             // '?' or ':' after getopt_long's own diagnostic, or a value

@@ -13,6 +13,7 @@
 #include "cli/heapfile_arguments.h"
 #include "output/json_formatter.h"
 #include "output/text_formatter.h"
+#include "output/top_formatter.h"
 #include "targets/corpse_process.h"
 #include "targets/platform/linux/linux_platform.h"
 #include "targets/process.h"
@@ -181,7 +182,9 @@ int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArgum
     }
 
     // "--json -": the document goes to standard output in place of the text.
-    if (!options.jsonPath || *options.jsonPath != "-") {
+    if (options.top) {
+        vestage.addOutputFormatter(std::make_unique<VSOutputFormatterTop>(*options.top, options.summaryFormat));
+    } else if (!options.jsonPath || *options.jsonPath != "-") {
         vestage.addOutputFormatter(
             std::make_unique<VSOutputFormatterText>(options.summaryFormat, options.outputOptions));
     }

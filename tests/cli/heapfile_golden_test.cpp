@@ -13,6 +13,8 @@ TEST(HeapfileGolden, ReportsOfTheCheckedInHeapfiles) {
     const std::pair<const char *, std::vector<std::string>> cases[] = {  // stored as REPORT.txt, command line
         {"linux-worker", {"-f", "bytes", "--swapped", "linux-worker.heap"}},
         {"linux-workers-sharing", {"linux-worker.heap", "linux-worker-peer.heap"}},
+        {"linux-workers-top", {"--top", "linux-worker.heap", "linux-worker-peer.heap"}},
+        {"linux-workers-top-1-bytes", {"--top=1", "-f", "bytes", "linux-worker.heap", "linux-worker-peer.heap"}},
         {"arm64-shared-cache", {"-v", "-f", "bytes", "--swapped", "arm64-shared-cache.heap"}},
         {"armv7k-breakdown", {"-v", "-f", "bytes", "armv7k-breakdown.heap"}},
     };

@@ -25,6 +25,7 @@ const char *const kUsage =
     "\t--swapped\t\t\t\tshow swapped/compressed column\n"
     "\t--wired\t\t\t\t\tshow wired column\n"
     "\t-j -, --json -\t\t\t\twrite the json document to standard output instead of the text report\n"
+    "\t--top[=N]\t\t\t\tone line per process, largest vestage first (default: 20 lines)\n"
     "\t--version\t\t\t\tprint the version and exit\n";
 
 const char *const kCorpseUsage =
@@ -52,6 +53,8 @@ TEST(ProgramRun, OptionScanAndTargetOutcomes) {
         {{"--he"}, usage, "", 0},
         {{"--version"}, "vestage 0.1\n", "", 0},
         {{"--vers"}, usage, "vestage: unrecognized option '--vers'\n", 1},
+        {{"--top=0", "-a"}, "", "--top wants a number of lines above 0, not '0'.\n", 1},
+        {{"--top=x"}, "", "--top wants a number of lines above 0, not 'x'.\n", 1},
         {{"-h", "-f", "Formatted"}, usage, "", 0},
         {{"-f", "Formatted", "-h"}, "", kBadFormat, 1},
         {{"--format=Bytes"}, "", kBadFormat, 1},
