@@ -17,6 +17,7 @@ enum : int {
     OptionSwapped = 261,
     OptionWired = 262,
     OptionTop = 263,
+    OptionOpenMetrics = 264,
 };
 
 void putLine(FILE *out, const char *line) {
@@ -73,6 +74,7 @@ void printUsage(FILE *out) {
     putLine(out, "\t--wired\t\t\t\t\tshow wired column");
     putLine(out, "\t-j -, --json -\t\t\t\twrite the json document to standard output instead of the text report");
     putLine(out, "\t--top[=N]\t\t\t\tone line per process, largest vestage first (default: 20 lines)");
+    putLine(out, "\t--openmetrics <file> \t\t\twrite the figures in the OpenMetrics text format (- for standard output)");
     putLine(out, "\t--version\t\t\t\tprint the version and exit");
 }
 
@@ -114,6 +116,7 @@ OptionScanResult scanOptions(int argc, char **argv, FILE *out, FILE *err) {
         {"swapped", no_argument, nullptr, OptionSwapped},
         {"wired", no_argument, nullptr, OptionWired},
         {"top", optional_argument, nullptr, OptionTop},
+        {"openmetrics", required_argument, nullptr, OptionOpenMetrics},
         {nullptr, 0, nullptr, 0},
     };
 
@@ -223,6 +226,9 @@ OptionScanResult scanOptions(int argc, char **argv, FILE *out, FILE *err) {
             break;
         case OptionWired:
             options.outputOptions |= VSOutputOptionWired;
+            break;
+        case OptionOpenMetrics:
+            options.openMetricsPath = optarg;
             break;
         case OptionTop: {
             constexpr std::size_t kDefaultTopLines = 20;

@@ -31,7 +31,8 @@ struct VSRunOptions {
     uint64_t corpseDirtyFlags = 0;
     uint64_t corpseProcFlags = 0;
     bool breakDownRequested = false;
-    std::optional<std::size_t> top;  // --top: at most this many lines instead of the report
+    std::optional<std::size_t> top;
+    std::optional<std::string> openMetricsPath;  // present: also write the OpenMetrics text ("-": stdout)  // --top: at most this many lines instead of the report
 
     bool operator==(const VSRunOptions &) const = default;
 };

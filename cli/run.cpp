@@ -13,6 +13,7 @@
 #include "cli/heapfile_arguments.h"
 #include "output/json_formatter.h"
 #include "output/text_formatter.h"
+#include "output/openmetrics_formatter.h"
 #include "output/top_formatter.h"
 #include "targets/corpse_process.h"
 #include "targets/platform/linux/linux_platform.h"
@@ -182,11 +183,16 @@ int runSequence(VSRunOptions &options, const std::vector<std::string> &bareArgum
     }
 
     // "--json -": the document goes to standard output in place of the text.
+    const bool documentOnStandardOutput =
+        (options.jsonPath && *options.jsonPath == "-") || (options.openMetricsPath && *options.openMetricsPath == "-");
     if (options.top) {
         vestage.addOutputFormatter(std::make_unique<VSOutputFormatterTop>(*options.top, options.summaryFormat));
-    } else if (!options.jsonPath || *options.jsonPath != "-") {
+    } else if (!documentOnStandardOutput) {
         vestage.addOutputFormatter(
             std::make_unique<VSOutputFormatterText>(options.summaryFormat, options.outputOptions));
+    }
+    if (options.openMetricsPath) {
+        vestage.addOutputFormatter(std::make_unique<VSOutputFormatterOpenMetrics>(*options.openMetricsPath));
     }
     if (options.jsonPath) {
         vestage.addOutputFormatter(std::make_unique<VSOutputFormatterJSON>(*options.jsonPath));

@@ -15,6 +15,7 @@ TEST(HeapfileGolden, ReportsOfTheCheckedInHeapfiles) {
         {"linux-workers-sharing", {"linux-worker.heap", "linux-worker-peer.heap"}},
         {"linux-workers-top", {"--top", "linux-worker.heap", "linux-worker-peer.heap"}},
         {"linux-workers-top-1-bytes", {"--top=1", "-f", "bytes", "linux-worker.heap", "linux-worker-peer.heap"}},
+        {"linux-workers-openmetrics", {"--openmetrics", "-", "linux-worker.heap", "linux-worker-peer.heap"}},
         {"arm64-shared-cache", {"-v", "-f", "bytes", "--swapped", "arm64-shared-cache.heap"}},
         {"armv7k-breakdown", {"-v", "-f", "bytes", "armv7k-breakdown.heap"}},
     };
@@ -26,6 +27,45 @@ TEST(HeapfileGolden, ReportsOfTheCheckedInHeapfiles) {
         std::ostringstream stored;
         stored << std::ifstream(fixtures + report + ".txt", std::ios::binary).rdbuf();
         EXPECT_EQ(run.out, stored.str());
+    }
+}
+
+// The OpenMetrics text as a real scraper's parser reads it: every family a
+// gauge in bytes, every sample parsed, the document closed by "# EOF". The
+// kernel's categories bring names of every shape.
+TEST(OpenMetricsRun, ARealParserReadsEveryFamily) {
+    const std::string parser = "/usr/bin/python3"; // the distribution's, which has the parser package
+    if (access(parser.c_str(), X_OK) != 0) GTEST_SKIP() << "no python3 for the parser";
+    const std::string fixtures = VESTAGE_TEST_DATA_DIR "/heapfiles/";
+    std::vector<std::vector<std::string>> runs = {
+        {"--openmetrics", "-", fixtures + "linux-worker.heap", fixtures + "linux-worker-peer.heap"}};
+    if (geteuid() == 0) runs.push_back({"--openmetrics", "-", "-p", "0", "-p", std::to_string(getpid())});
+    for (const auto &args : runs) {
+        SCOPED_TRACE(args.back());
+        const vs::test::RunResult run = vs::test::runProgram(args);
+        ASSERT_EQ(run.status, 0) << run.err;
+        vs::test::ScratchDir dir;
+        const std::string input = dir.path + "/metrics.txt";
+        std::ofstream(input) << run.out;
+        const std::string script =
+            "import sys\n"
+            "from prometheus_client.openmetrics.parser import text_string_to_metric_families as parse\n"
+            "for f in parse(open(sys.argv[1]).read()):\n"
+            "    print(f.name, f.type, f.unit, len(f.samples))\n";
+        const std::string command = parser + " -c '" + script + "' " + input + " 2>&1";
+        std::string parsed;
+        if (FILE *pipe = popen(command.c_str(), "r")) {
+            char buffer[4096];
+            for (size_t n; (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;) parsed.append(buffer, n);
+            const int status = pclose(pipe);
+            if (parsed.find("No module named") != std::string::npos) GTEST_SKIP() << parsed;
+            EXPECT_EQ(status, 0) << parsed << run.out;
+        }
+        EXPECT_NE(parsed.find("vestage_process_bytes gauge bytes 2"), std::string::npos) << parsed;
+        EXPECT_NE(parsed.find("vestage_summary_bytes gauge bytes 6"), std::string::npos) << parsed;
+        if (args.back() != fixtures + "linux-worker-peer.heap") {
+            EXPECT_NE(parsed.find("vestage_kernel_bytes gauge bytes"), std::string::npos) << parsed;
+        }
     }
 }
 

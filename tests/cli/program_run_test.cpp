@@ -26,6 +26,7 @@ const char *const kUsage =
     "\t--wired\t\t\t\t\tshow wired column\n"
     "\t-j -, --json -\t\t\t\twrite the json document to standard output instead of the text report\n"
     "\t--top[=N]\t\t\t\tone line per process, largest vestage first (default: 20 lines)\n"
+    "\t--openmetrics <file> \t\t\twrite the figures in the OpenMetrics text format (- for standard output)\n"
     "\t--version\t\t\t\tprint the version and exit\n";
 
 const char *const kCorpseUsage =

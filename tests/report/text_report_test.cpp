@@ -1,5 +1,6 @@
 // The text report byte for byte: whole driver runs over prepared targets.
 
+#include "output/openmetrics_formatter.h"
 #include "output/visible_text.h"
 #include "tests/report/report_support.h"
 
@@ -134,3 +135,23 @@ TEST(TextReport, NamesFromOtherUsersCannotActOnTheTerminal) {
         EXPECT_NE(text.find(line), std::string::npos) << line << "\n" << text;
     }
 }
+
+namespace {
+
+// Label values as scrapers read them back: the three escapes, and bytes
+// that are not UTF-8 replaced rather than passed on.
+TEST(OpenMetricsText, LabelValuesAreEscaped) {
+    const std::pair<std::string, std::string> cases[] = {
+        {"worker", "worker"},
+        {"say \"hi\"", "say \\\"hi\\\""},
+        {"C:\\dir", "C:\\\\dir"},
+        {"two\nlines", "two\\nlines"},
+        {"mem\xff" "child", "mem\xEF\xBF\xBD" "child"},
+        {"caf\xC3\xA9", "caf\xC3\xA9"},
+    };
+    for (const auto &[name, expected] : cases) {
+        EXPECT_EQ(VSOutputFormatterOpenMetrics::labelValue(name), expected) << name;
+    }
+}
+
+}  // namespace
