@@ -36,7 +36,8 @@ std::string parsed(bool stat, std::string_view text) {
         const auto st = vs::parseStat(text);
         if (st) {
             result = "'" + st->comm + "' " + st->state + " ppid " + std::to_string(st->ppid) + " threads " +
-                     std::to_string(st->numThreads) + ((st->flags & vs::kLinuxKernelThreadFlag) ? " kthread" : "");
+                     std::to_string(st->numThreads) + ((st->flags & vs::kLinuxKernelThreadFlag) ? " kthread" : "") +
+                     (vs::statSaysGone(*st) ? " gone" : "");
         }
         return result;
     }
@@ -89,7 +90,10 @@ TEST(LinuxProcText, SmapsAndStatEdgeCases) {
         {"stat: kernel thread", true, "2 (kthreadd) S 0 0 0 0 -1 2129984 0 0 0 0 0 0 0 0 20 0 1 0 1 0 0\n",
          "'kthreadd' S ppid 0 threads 1 kthread"},
         {"stat: zombie", true, "77 (ex it) Z 76 76 1 0 -1 4227084 0 0 0 0 0 0 0 0 20 0 1 0 9 0 0\n",
-         "'ex it' Z ppid 76 threads 1"},
+         "'ex it' Z ppid 76 threads 1 gone"},
+        // SIGKILLed with 3 GiB: for a while it still runs, tearing its memory down.
+        {"stat: exiting", true, "78 (big) R 1 78 78 0 -1 4194628 0 0 0 0 0 0 0 0 20 0 1 0 9 0 0\n",
+         "'big' R ppid 1 threads 1 gone"},
         {"stat: empty name, no newline", true, "8 () S 1 8 8 0 -1 0 0 0 0 0 0 0 0 0 20 0 1 0 9 0 0",
          "'' S ppid 1 threads 1"},
         {"stat: cut after the name", true, "9 (x)", ""},

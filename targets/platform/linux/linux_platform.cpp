@@ -87,8 +87,6 @@ namespace {
 // Kernel stack of one thread (THREAD_SIZE) on the architectures we build for.
 constexpr uint64_t kKernelStackSize = 16 * 1024;
 
-constexpr uint64_t kProcessExitingFlag = 0x4; // PF_EXITING
-
 // Region queries keep 1 and 4 for their own meanings, so the two errnos with
 // those numbers are reported as their nearest neighbours.
 VSReturnCode regionErrno(int error) {
@@ -122,7 +120,7 @@ bool processHasGone(int dirFd) {
     if (!st) {
         return false;
     }
-    return st->state == 'Z' || st->state == 'X' || (st->flags & kProcessExitingFlag) != 0;
+    return vs::statSaysGone(*st);
 }
 
 std::vector<uint64_t> threadStackPointers(int dirFd) {
@@ -477,6 +475,12 @@ int32_t VSLinuxPlatform::pid_short_info(int32_t pid, VSShortInfo &info, int32_t 
     }
     const auto st = vs::parseStat(text);
     if (!st) {
+        errorNumber = vs::kErrorNoSuchProcess;
+        return 0;
+    }
+    // Exiting: its memory is being torn down and reads empty. It has gone
+    // for every purpose of a report, which says so instead of an error.
+    if (st->state != 'Z' && st->state != 'X' && vs::statSaysGone(*st)) {
         errorNumber = vs::kErrorNoSuchProcess;
         return 0;
     }

@@ -99,6 +99,11 @@ std::optional<ProcStat> parseStat(std::string_view text) {
     return st;
 }
 
+bool statSaysGone(const ProcStat &stat) {
+    constexpr uint64_t kExitingFlag = 0x4; // PF_EXITING
+    return stat.state == 'Z' || stat.state == 'X' || (stat.flags & kExitingFlag) != 0;
+}
+
 std::optional<std::string_view> statusValue(std::string_view status, std::string_view name) {
     size_t pos = 0;
     while (pos < status.size()) {

@@ -28,6 +28,10 @@ inline constexpr uint64_t kLinuxKernelThreadFlag = 0x00200000; // PF_KTHREAD
 
 std::optional<ProcStat> parseStat(std::string_view text);
 
+// A process that has gone, or is going: a zombie, dead, or exiting
+// (PF_EXITING: its address space is being torn down and reads empty).
+bool statSaysGone(const ProcStat &stat);
+
 // The text after "Name:" of a status line, blanks trimmed; nullopt when the
 // line is missing.
 std::optional<std::string_view> statusValue(std::string_view status, std::string_view name);
