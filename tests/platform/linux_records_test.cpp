@@ -14,6 +14,7 @@
 #include <gtest/gtest.h>
 #include <optional>
 #include <string>
+#include <thread>
 #include <tuple>
 
 namespace {
@@ -377,6 +378,40 @@ TEST(LinuxElfImages, WhatIsReadForImages) {
             EXPECT_EQ(images[0].segments.size(), 2u);
         }
     }
+}
+
+} // namespace
+
+namespace {
+
+// Targets are walked on several workers at once, all asking one table: every
+// key gets one id, however the askers interleave.
+TEST(LinuxObjectIds, ManyWalkersAskingAtOnceGetOneIdPerKey) {
+    vs::ObjectIdTable ids;
+    constexpr int kKeys = 20000; // enough interleaving to break an unguarded table; ThreadSanitizer sees any race
+    std::vector<std::vector<uint32_t>> seen(4);
+    std::vector<std::thread> walkers;
+    for (size_t w = 0; w < seen.size(); ++w) {
+        walkers.emplace_back([&, w] {
+            for (int k = 0; k < kKeys; ++k) {
+                // Every walker asks for every key, in its own order.
+                const int key = w % 2 == 0 ? k : kKeys - 1 - k;
+                seen[w].push_back(ids.idForFileWindow(1, static_cast<uint64_t>(key), 0));
+                (void)ids.freshId();
+            }
+        });
+    }
+    for (std::thread &walker : walkers) walker.join();
+    for (size_t w = 1; w < seen.size(); ++w) {
+        std::vector<uint32_t> mine = seen[w], first = seen[0];
+        if (w % 2 == 1) std::reverse(mine.begin(), mine.end());
+        EXPECT_EQ(mine, first) << "walker " << w;
+    }
+    std::vector<uint32_t> all = seen[0];
+    std::sort(all.begin(), all.end());
+    EXPECT_EQ(std::unique(all.begin(), all.end()), all.end()) << "one id per key";
+    // Dense from 1: the keys' ids and the fresh ones together fill 1..n.
+    EXPECT_EQ(ids.freshId(), static_cast<uint32_t>(kKeys + seen.size() * kKeys + 1));
 }
 
 } // namespace

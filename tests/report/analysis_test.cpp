@@ -35,6 +35,8 @@ TEST(Merging, RegionsBecomeMemoryObjectsByKey) {
         {"one object", {.objectId = 9}, {.objectId = 9}, true, true, {1, 0, 0, 0, 0}},
         {"copy-on-write, dirty in both", {.objectId = 9, .dirty = 1, .shareMode = cow},
          {.objectId = 9, .dirty = 1, .shareMode = cow}, true, false, {2, 0, 0, 0, 0}},
+        {"copy-on-write, only swapped in both", {.objectId = 9, .swapped = 1, .shareMode = cow},
+         {.objectId = 9, .swapped = 1, .shareMode = cow}, true, false, {2, 0, 0, 0, 0}},
         {"copy-on-write, untouched", {.objectId = 9, .clean = 1, .shareMode = cow},
          {.objectId = 9, .clean = 1, .shareMode = cow}, true, true, {1, 0, 0, 0, 0}},
         {"no object id", {}, {}, true, false, {0, 0, 0, 0, 2}},

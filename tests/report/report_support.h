@@ -97,7 +97,7 @@ public:
     // Gathers unless done already; the text report as printed to standard
     // output (where the breakdown note goes too), after any `more` formatters.
     std::string report(std::int64_t format = VSSummaryFormatFormatted, std::int64_t options = 0,
-                       std::unique_ptr<VSOutputFormatter> more = nullptr) {
+                       std::unique_ptr<VSOutputFormatter> more = nullptr, bool summarize = false) {
         if (!vestage) {
             gather();
         }
@@ -106,7 +106,7 @@ public:
             vestage->addOutputFormatter(std::move(more));
         }
         testing::internal::CaptureStdout();
-        vestage->printOutputVerbose(false, false);
+        vestage->printOutputVerbose(false, summarize);
         return testing::internal::GetCapturedStdout();
     }
 
