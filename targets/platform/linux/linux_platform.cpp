@@ -17,6 +17,7 @@
 #include <elf.h>
 #include <fcntl.h>
 #include <malloc.h>
+#include <sys/ioctl.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
@@ -947,6 +948,25 @@ void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, s
                  });
 }
 
+namespace {
+
+// The pagemap scan (Linux 6.7): which parts of a range hold pages at all.
+struct PageRegion {
+    uint64_t start, end, categories;
+};
+struct PagemapScan {
+    uint64_t size, flags, start, end, walkEnd, vec, vecLength, maxPages, categoryInverted, categoryMask,
+        categoryAnyOf, returnMask;
+};
+constexpr unsigned long kPagemapScan = _IOWR('f', 16, PagemapScan);
+constexpr uint64_t kPageIsPresent = 1u << 3;
+constexpr uint64_t kPageIsSwapped = 1u << 4;
+// Without the scan a range is read whole; past this many pages (64 GiB of
+// 4 KiB pages) that costs more than it can tell.
+constexpr uint64_t kMaxUnscannedPages = uint64_t{1} << 24;
+
+} // namespace
+
 bool VSLinuxPlatform::_readPagemap(int pagemapFd, uint64_t address, uint64_t pages,
                                    const std::function<bool(std::span<const uint64_t>, uint64_t)> &batch) {
     constexpr uint64_t kBatch = 16384; // 128 KiB of entries per read
@@ -954,21 +974,65 @@ bool VSLinuxPlatform::_readPagemap(int pagemapFd, uint64_t address, uint64_t pag
     // the reads.
     thread_local std::vector<uint64_t> entries;
     entries.resize(kBatch);
-    for (uint64_t done = 0; done < pages;) {
-        const uint64_t want = std::min(pages - done, kBatch);
-        const off_t offset = static_cast<off_t>((address / _pageSize + done) * sizeof(uint64_t));
-        const ssize_t n = ::pread(pagemapFd, entries.data(), want * sizeof(uint64_t), offset);
-        if (n <= 0) {
-            return false;
+    // Reads [first, first + count) pages of the range; false to stop.
+    auto readPages = [&](uint64_t first, uint64_t count, bool &failed) {
+        for (uint64_t done = 0; done < count;) {
+            const uint64_t want = std::min(count - done, kBatch);
+            const off_t offset = static_cast<off_t>((address / _pageSize + first + done) * sizeof(uint64_t));
+            const ssize_t n = ::pread(pagemapFd, entries.data(), want * sizeof(uint64_t), offset);
+            if (n <= 0) {
+                failed = true;
+                return false;
+            }
+            const uint64_t got = static_cast<uint64_t>(n) / sizeof(uint64_t);
+            if (!batch(std::span<const uint64_t>(entries.data(), got), first + done)) {
+                return false;
+            }
+            done += got;
+            if (got < want) {
+                return false;
+            }
         }
-        const uint64_t got = static_cast<uint64_t>(n) / sizeof(uint64_t);
-        if (!batch(std::span<const uint64_t>(entries.data(), got), done)) {
-            return true;
+        return true;
+    };
+
+    // A sparse mapping (a sanitizer's shadow, a runtime's reservation) can
+    // span terabytes of which a few pages are there: read only those.
+    const uint64_t end = address + pages * _pageSize;
+    thread_local std::vector<PageRegion> populated;
+    populated.resize(512);
+    bool failed = false;
+    for (uint64_t at = address; at < end;) {
+        PagemapScan scan{};
+        scan.size = sizeof scan;
+        scan.start = at;
+        scan.end = end;
+        scan.vec = reinterpret_cast<uint64_t>(populated.data());
+        scan.vecLength = populated.size();
+        scan.categoryAnyOf = kPageIsPresent | kPageIsSwapped;
+        scan.returnMask = kPageIsPresent | kPageIsSwapped;
+        const int found = ::ioctl(pagemapFd, kPagemapScan, &scan);
+        if (found < 0) {
+            if (at != address) {
+                return false; // the process changed under the scan
+            }
+            // An older kernel: the whole range, when that is bearable.
+            if (pages > kMaxUnscannedPages) {
+                return false;
+            }
+            readPages(0, pages, failed);
+            return !failed;
         }
-        done += got;
-        if (got < want) {
+        for (int i = 0; i < found; ++i) {
+            const uint64_t first = (populated[i].start - address) / _pageSize;
+            if (!readPages(first, (populated[i].end - populated[i].start) / _pageSize, failed)) {
+                return !failed;
+            }
+        }
+        if (scan.walkEnd <= at || scan.walkEnd >= end) {
             break;
         }
+        at = scan.walkEnd;
     }
     return true;
 }
