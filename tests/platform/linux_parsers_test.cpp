@@ -4,6 +4,7 @@
 #include "targets/platform/linux/smaps_parser.h"
 
 #include <gtest/gtest.h>
+#include <tuple>
 #include <sstream>
 #include <string>
 #include <string_view>
@@ -154,6 +155,38 @@ TEST(LinuxProcText, StatusAndThreadStackPointer) {
               0x7ffd9a2c1e38u);
     EXPECT_EQ(vs::parseSyscallStackPointer("-1 0x7f3b8d7fe9d0 0x7f3b8e0a1234\n"), 0x7f3b8d7fe9d0u);
     EXPECT_EQ(vs::parseSyscallStackPointer("running\n"), std::nullopt);
+}
+
+} // namespace
+
+namespace {
+
+// A parse held packed while it waits comes back exactly as it was.
+TEST(LinuxProcText, PackedRegionsComeBackExactly) {
+    const std::string text =
+        "00400000-00452000 r-xp 00000000 fe:00 1234 /usr/bin/with space (deleted)\nRss: 328 kB\n"
+        "Shared_Clean: 300 kB\nPrivate_Dirty: 28 kB\nLocked: 4 kB\nVmFlags: rd ex mr mw me dw\n"
+        "00652000-00653000 rw-p 00052000 fe:00 1234 /usr/bin/with space (deleted)\nRss: 4 kB\n"
+        "Anonymous: 4 kB\nSwap: 8 kB\nSwapPss: 4 kB\nLazyFree: 4 kB\n"
+        "7f0000000000-7f0000400000 rw-s 00000000 00:10 77 /anon_hugepage (deleted)\nShared_Hugetlb: 2048 kB\n"
+        "Private_Hugetlb: 2048 kB\nVmFlags: rd wr sh ht\n"
+        "ffffffffff600000-ffffffffff601000 --xp 00000000 00:00 0 [vsyscall]\n";
+    std::vector<vs::SmapsRegion> regions, back;
+    ASSERT_EQ(vs::parseSmaps(text, regions), 4u);
+    vs::unpackSmapsRegions(vs::packSmapsRegions(regions), back);
+    ASSERT_EQ(back.size(), regions.size());
+    for (size_t i = 0; i < regions.size(); ++i) {
+        EXPECT_EQ(summary(back[i]), summary(regions[i])) << i;
+        const auto fields = [](const vs::SmapsRegion &r) {
+            return std::make_tuple(r.start, r.end, r.offset, r.inode, r.devMajor, r.devMinor, r.read, r.write, r.exec,
+                                   r.shared, r.path, r.rss, r.sharedClean, r.sharedDirty, r.privateClean,
+                                   r.privateDirty, r.lazyFree, r.anonymous, r.swap, r.swapPss, r.privateHugetlb,
+                                   r.sharedHugetlb, r.locked, r.vmFlags, r.hasVmFlags);
+        };
+        EXPECT_TRUE(fields(back[i]) == fields(regions[i])) << i;
+    }
+    // Each path once, whatever number of mappings show it.
+    EXPECT_EQ(vs::packSmapsRegions(regions).paths.size(), 3u);
 }
 
 } // namespace

@@ -77,6 +77,10 @@ struct VSLinuxPlatform::Task {
     };
     std::vector<StoredKeys> storedKeys;
     std::vector<uint8_t> storedBytes;
+    // A prepared parse waiting for the run is held packed (a run holds
+    // every waiting target's at once); the first region query unpacks it.
+    bool isPacked = false;
+    vs::PackedSmapsRegions packed;
     // The status read for the kernel-memory counters, kept for the one
     // resource-usage query that a target makes right after it (both are
     // taken at construction); used once, then dropped.
@@ -585,6 +589,7 @@ int32_t VSLinuxPlatform::pid_region_filename(int32_t pid, uint64_t address,
         }
     }
     if (held) {
+        _ensureParsed(*held); // unpacks a parse that waited for the run
         const size_t i = regionAtOrAbove(held->regions, address);
         if (i < held->regions.size() && held->regions[i].start <= address) {
             path = held->regions[i].path;
@@ -1128,6 +1133,11 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
     }
     task->prepared = true;
     task->partsBuilt = false;
+    if (any) {
+        task->packed = vs::packSmapsRegions(task->regions);
+        std::vector<SmapsRegion>().swap(task->regions);
+        task->isPacked = true;
+    }
     return any;
 }
 
@@ -1175,6 +1185,8 @@ bool VSLinuxPlatform::resolve_shared_pages() {
 
 void VSLinuxPlatform::_releaseParse(Task &task) {
     std::vector<SmapsRegion>().swap(task.regions);
+    task.packed = vs::PackedSmapsRegions{};
+    task.isPacked = false;
     std::vector<vs::MappingKind>().swap(task.kinds);
     std::vector<uint32_t>().swap(task.tags);
     std::vector<VSRegionInfo>().swap(task.parts);
@@ -1188,6 +1200,11 @@ VSReturnCode VSLinuxPlatform::_ensureParsed(Task &task) {
     if (!task.parsed) {
         task.parseCode = _parse(task);
         task.parsed = true;
+    }
+    if (task.isPacked) {
+        vs::unpackSmapsRegions(task.packed, task.regions);
+        task.packed = vs::PackedSmapsRegions{};
+        task.isPacked = false;
     }
     return task.parseCode;
 }

@@ -44,15 +44,13 @@ std::optional<std::string> ObjectIdTable::stableIdentity(uint32_t id) const {
         return std::nullopt;
     }
     const auto &[kind, a, b, c, name] = found->second;
-    auto file = [&] {
-        return "file " + std::to_string(a >> 32) + ":" + std::to_string(a & 0xFFFFFFFFu) + " inode " +
-               std::to_string(b);
-    };
+    const std::string file =
+        "file " + std::to_string(a >> 32) + ":" + std::to_string(a & 0xFFFFFFFFu) + " inode " + std::to_string(b);
     switch (kind) {
     case Kind::File:
-        return file();
+        return file;
     case Kind::FileWindow:
-        return file() + " offset " + std::to_string(c);
+        return file + " offset " + std::to_string(c);
     case Kind::Name:
         return "kernel mapping " + name;
     case Kind::FrameSet:

@@ -356,4 +356,107 @@ MappingKind mappingKind(const SmapsRegion &region, const std::vector<uint64_t> &
     return MappingKind::File;
 }
 
+namespace {
+
+void putNumber(std::vector<uint8_t> &out, uint64_t value) {
+    while (value >= 0x80) {
+        out.push_back(static_cast<uint8_t>(value | 0x80));
+        value >>= 7;
+    }
+    out.push_back(static_cast<uint8_t>(value));
+}
+
+uint64_t takeNumber(const std::vector<uint8_t> &bytes, size_t &at) {
+    uint64_t value = 0;
+    for (unsigned shift = 0; at < bytes.size() && shift < 64; shift += 7) {
+        const uint8_t byte = bytes[at++];
+        value |= uint64_t{byte & 0x7Fu} << shift;
+        if ((byte & 0x80) == 0) {
+            break;
+        }
+    }
+    return value;
+}
+
+// The counters of a region, in packing order.
+template <class Region, class Visit>
+void forEachCounter(Region &r, Visit visit) {
+    for (auto *field : {&r.rss, &r.sharedClean, &r.sharedDirty, &r.privateClean, &r.privateDirty, &r.lazyFree,
+                        &r.anonymous, &r.swap, &r.swapPss, &r.privateHugetlb, &r.sharedHugetlb, &r.locked}) {
+        visit(*field);
+    }
+}
+
+} // namespace
+
+PackedSmapsRegions packSmapsRegions(const std::vector<SmapsRegion> &regions) {
+    PackedSmapsRegions packed;
+    packed.count = regions.size();
+    packed.bytes.reserve(regions.size() * 24);
+    std::vector<uint64_t> recent; // indexes of recent paths: a process has few distinct ones
+    uint64_t previousEnd = 0;
+    for (const SmapsRegion &r : regions) {
+        // Mappings come in address order: the gap to the previous end is small.
+        putNumber(packed.bytes, r.start - previousEnd);
+        putNumber(packed.bytes, r.end - r.start);
+        putNumber(packed.bytes, r.offset);
+        putNumber(packed.bytes, r.inode);
+        putNumber(packed.bytes, r.devMajor);
+        putNumber(packed.bytes, r.devMinor);
+        putNumber(packed.bytes, (r.read ? 1u : 0u) | (r.write ? 2u : 0u) | (r.exec ? 4u : 0u) | (r.shared ? 8u : 0u) |
+                                    (r.hasVmFlags ? 16u : 0u));
+        uint64_t pathIndex = 0; // 0: no path
+        if (!r.path.empty()) {
+            const auto found = std::find_if(recent.begin(), recent.end(),
+                                            [&](uint64_t index) { return packed.paths[index - 1] == r.path; });
+            if (found != recent.end()) {
+                pathIndex = *found;
+            } else {
+                packed.paths.push_back(r.path);
+                pathIndex = packed.paths.size();
+                recent.push_back(pathIndex);
+                if (recent.size() > 64) {
+                    recent.erase(recent.begin());
+                }
+            }
+        }
+        putNumber(packed.bytes, pathIndex);
+        forEachCounter(r, [&](const uint64_t &value) { putNumber(packed.bytes, value); });
+        putNumber(packed.bytes, r.vmFlags);
+        previousEnd = r.end;
+    }
+    packed.bytes.shrink_to_fit();
+    return packed;
+}
+
+void unpackSmapsRegions(const PackedSmapsRegions &packed, std::vector<SmapsRegion> &regions) {
+    regions.clear();
+    regions.reserve(packed.count);
+    size_t at = 0;
+    uint64_t previousEnd = 0;
+    for (size_t i = 0; i < packed.count; ++i) {
+        SmapsRegion r;
+        r.start = previousEnd + takeNumber(packed.bytes, at);
+        r.end = r.start + takeNumber(packed.bytes, at);
+        r.offset = takeNumber(packed.bytes, at);
+        r.inode = takeNumber(packed.bytes, at);
+        r.devMajor = static_cast<uint32_t>(takeNumber(packed.bytes, at));
+        r.devMinor = static_cast<uint32_t>(takeNumber(packed.bytes, at));
+        const uint64_t bits = takeNumber(packed.bytes, at);
+        r.read = (bits & 1) != 0;
+        r.write = (bits & 2) != 0;
+        r.exec = (bits & 4) != 0;
+        r.shared = (bits & 8) != 0;
+        r.hasVmFlags = (bits & 16) != 0;
+        const uint64_t pathIndex = takeNumber(packed.bytes, at);
+        if (pathIndex != 0 && pathIndex <= packed.paths.size()) {
+            r.path = packed.paths[pathIndex - 1];
+        }
+        forEachCounter(r, [&](uint64_t &value) { value = takeNumber(packed.bytes, at); });
+        r.vmFlags = takeNumber(packed.bytes, at);
+        previousEnd = r.end;
+        regions.push_back(std::move(r));
+    }
+}
+
 } // namespace vs

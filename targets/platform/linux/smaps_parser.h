@@ -90,6 +90,18 @@ struct SmapsRegion {
 // returns the number appended. Never fails: unparseable lines are skipped.
 size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out);
 
+// Parsed regions kept small while they wait (a run holds every target's
+// parse until the pages they share are known): variable-length numbers,
+// each distinct path once. unpackSmapsRegions gives back exactly what was
+// packed.
+struct PackedSmapsRegions {
+    std::vector<uint8_t> bytes;
+    std::vector<std::string> paths;
+    size_t count = 0;
+};
+PackedSmapsRegions packSmapsRegions(const std::vector<SmapsRegion> &regions);
+void unpackSmapsRegions(const PackedSmapsRegions &packed, std::vector<SmapsRegion> &regions);
+
 // What kind of memory a mapping is, from its path, device and inode. The
 // shmem family (tmpfs files, memfd, SysV segments, shared anonymous memory
 // shown as "/dev/zero (deleted)") has pages that cannot be dropped, so it
