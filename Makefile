@@ -67,7 +67,7 @@ fuzz: setup
 	    case $$target in smaps) seeds=$(FUZZ_SEEDS_smaps);; proc) seeds=$(FUZZ_SEEDS_proc);; \
 	        kernel) seeds=$(FUZZ_SEEDS_kernel);; elf) seeds=$(FUZZ_SEEDS_elf);; esac; \
 	    echo "fuzz_$$target: $(FUZZ_SECONDS) s"; \
-	    ./$(BUILD_DIR)-fuzz/fuzz_$$target -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
+	    $(BUILD_DIR)-fuzz/fuzz_$$target -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
 	        $(BUILD_DIR)-fuzz/corpus-$$target $$seeds > $(BUILD_DIR)-fuzz/fuzz_$$target.log 2>&1; \
 	    status=$$?; grep -E "^(stat::number_of_executed_runs|stat::peak_rss_mb|==[0-9]+==ERROR|SUMMARY)" \
 	        $(BUILD_DIR)-fuzz/fuzz_$$target.log; \

@@ -18,7 +18,7 @@
 
 namespace {
 
-void fuzzHeapfile(std::string_view text) {
+[[maybe_unused]] void fuzzHeapfile(std::string_view text) {
     vs::HeapfileError error;
     if (auto snapshot = vs::parseHeapfile(text, &error)) {
         for (const VSHeapfileRegion &region : snapshot->regions) {
@@ -29,7 +29,7 @@ void fuzzHeapfile(std::string_view text) {
     }
 }
 
-void fuzzSmaps(std::string_view text) {
+[[maybe_unused]] void fuzzSmaps(std::string_view text) {
     std::vector<vs::SmapsRegion> regions;
     vs::parseSmaps(text, regions);
     for (const vs::SmapsRegion &region : regions) {
@@ -37,13 +37,13 @@ void fuzzSmaps(std::string_view text) {
     }
 }
 
-void fuzzProc(std::string_view text) {
+[[maybe_unused]] void fuzzProc(std::string_view text) {
     (void)vs::parseStat(text);
     (void)vs::statusBytes(text, "VmRSS");
     (void)vs::parseSyscallStackPointer(text);
 }
 
-void fuzzKernel(std::string_view text) {
+[[maybe_unused]] void fuzzKernel(std::string_view text) {
     (void)vs::parseSlabinfo(text);
     (void)vs::parseMeminfo(text);
     (void)vs::parseVmallocinfo(text);
@@ -51,7 +51,7 @@ void fuzzKernel(std::string_view text) {
     (void)vs::parsePerCpuFreePages(text);
 }
 
-void fuzzElf(std::string_view bytes) {
+[[maybe_unused]] void fuzzElf(std::string_view bytes) {
     uint64_t end = 0;
     if (auto info = vs::parseElfProgramHeaders(bytes, end)) {
         for (const vs::ImageSegment &segment : vs::imageSegments(*info, 0x7f0000000000ull, 4096)) {

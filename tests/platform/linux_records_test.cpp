@@ -95,7 +95,7 @@ TEST(LinuxRegionRecords, RecordFieldsFromSmaps) {
         EXPECT_EQ(info.inheritance, c.inheritance);
         EXPECT_EQ(info.protection, c.protection);
         EXPECT_EQ(info.maxProtection, c.maxProtection);
-        EXPECT_EQ(info.offset, c.offset);
+        EXPECT_EQ(uint64_t{info.offset}, c.offset); // a copy: the record is packed
         EXPECT_EQ(info.residentPages, c.resident);
         EXPECT_EQ(info.swappedOutPages, c.swapped);
         EXPECT_EQ(info.userWiredCount, c.wired);
@@ -192,7 +192,7 @@ TEST(LinuxRegionRecords, PartsOfOneMappingEachInOneObject) {
                 EXPECT_EQ(ids.stableIdentity(got.objectId).value_or("none"), want.object);
             }
             objects.push_back(got.objectId);
-            EXPECT_EQ(std::make_tuple(got.offset, got.residentPages, got.dirtiedPages, got.swappedOutPages,
+            EXPECT_EQ(std::make_tuple(uint64_t{got.offset}, got.residentPages, got.dirtiedPages, got.swappedOutPages,
                                       got.reusablePages, got.shareMode, got.externalPager),
                       std::make_tuple(want.offset, want.resident, want.dirty, want.swapped, want.reusable,
                                       want.shareMode, want.externalPager));
