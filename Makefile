@@ -69,7 +69,7 @@ fuzz: setup
 	    echo "fuzz_$$target: $(FUZZ_SECONDS) s"; \
 	    $(BUILD_DIR)-fuzz/fuzz_$$target -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
 	        $(BUILD_DIR)-fuzz/corpus-$$target $$seeds > $(BUILD_DIR)-fuzz/fuzz_$$target.log 2>&1; \
-	    status=$$?; grep -E "^(stat::number_of_executed_runs|stat::peak_rss_mb|==[0-9]+==ERROR|SUMMARY)" \
+	    status=$$?; grep -E "^(stat::number_of_executed_units|stat::peak_rss_mb|==[0-9]+==ERROR|SUMMARY)" \
 	        $(BUILD_DIR)-fuzz/fuzz_$$target.log; \
 	    [ $$status -eq 0 ] || { echo "fuzz_$$target found a fault: $(BUILD_DIR)-fuzz/fuzz_$$target.log" >&2; exit 1; }; \
 	done

@@ -17,6 +17,15 @@
 
 namespace {
 
+// The Linux layer as the current platform for one test, the previous one back after.
+struct LinuxPlatformInstalled {
+    explicit LinuxPlatformInstalled(VSLinuxPlatform &platform) : previous(VSPlatform::installed()) {
+        VSPlatform::setCurrent(&platform);
+    }
+    ~LinuxPlatformInstalled() { VSPlatform::setCurrent(previous); }
+    VSPlatform *previous;
+};
+
 // Category -> dirty, swapped, clean, reclaimable, wired, regions.
 std::map<std::string, std::array<uint64_t, 6>> categoriesOf(std::unique_ptr<VSProcess> target) {
     std::vector<std::unique_ptr<VSProcess>> targets;
@@ -49,11 +58,7 @@ TEST(HeapfileRoundTrip, CategoryTotalsOfAHeapfileMatchTheLiveProcess) {
                              program);
     ASSERT_TRUE(child.ready());
     VSLinuxPlatform linux;
-    const struct Restore {
-        VSPlatform *previous;
-        ~Restore() { VSPlatform::setCurrent(previous); }
-    } restore{VSPlatform::installed()};
-    VSPlatform::setCurrent(&linux);
+    const LinuxPlatformInstalled installed(linux);
 
     std::unique_ptr<VSProcess> live = VSProcess::processWithPid(child.pid());
     ASSERT_NE(live, nullptr) << "the child's memory cannot be read here";
@@ -91,11 +96,7 @@ TEST(HeapfileRoundTrip, AForkFamilyCapturedTogetherSharesItsPages) {
     vs::test::MemChild parent({"anon:big:" + pages + ":" + pages, "fork:one", "fork:two"});
     ASSERT_TRUE(parent.ready());
     VSLinuxPlatform linux;
-    const struct Restore {
-        VSPlatform *previous;
-        ~Restore() { VSPlatform::setCurrent(previous); }
-    } restore{VSPlatform::installed()};
-    VSPlatform::setCurrent(&linux);
+    const LinuxPlatformInstalled installed(linux);
     const std::vector<int32_t> pids = {parent.pid(), std::stoi(parent.fact("one", "pid")),
                                        std::stoi(parent.fact("two", "pid"))};
     const auto captured = vs::HeapfileCapture(vs::linuxObjectIdentity).captureTogether(pids);

@@ -1,5 +1,7 @@
 #include "targets/platform/linux/shared_pages.h"
 
+#include "targets/platform/linux/packed_numbers.h"
+
 #include <algorithm>
 #include <bit>
 #include <climits>
@@ -36,25 +38,7 @@ bool testBit(const std::vector<uint64_t> &bits, uint64_t index) {
     return index / 64 < bits.size() && (bits[index / 64] >> (index % 64) & 1) != 0;
 }
 
-void putNumber(uint64_t value, std::vector<uint8_t> &out) {
-    while (value >= 0x80) {
-        out.push_back(static_cast<uint8_t>(value | 0x80));
-        value >>= 7;
-    }
-    out.push_back(static_cast<uint8_t>(value));
-}
 
-uint64_t takeNumber(std::span<const uint8_t> bytes, size_t &at) {
-    uint64_t value = 0;
-    for (unsigned shift = 0; at < bytes.size() && shift < 64; shift += 7) {
-        const uint8_t byte = bytes[at++];
-        value |= uint64_t{byte & 0x7Fu} << shift;
-        if ((byte & 0x80) == 0) {
-            break;
-        }
-    }
-    return value;
-}
 
 size_t slotOf(uint64_t key, size_t mask) {
     return static_cast<size_t>((key * 0x9E3779B97F4A7C15ull) >> 17) & mask;
@@ -71,8 +55,8 @@ void encodeKeyRuns(std::span<const uint64_t> keys, std::vector<uint8_t> &out) {
         }
         // The distance either way, its sign in the lowest bit.
         const uint64_t distance = keys[i] - next;
-        putNumber((distance << 1) ^ static_cast<uint64_t>(static_cast<int64_t>(distance) >> 63), out);
-        putNumber(length, out);
+        vs::putPackedNumber(out, (distance << 1) ^ static_cast<uint64_t>(static_cast<int64_t>(distance) >> 63));
+        vs::putPackedNumber(out, length);
         next = keys[i] + length;
         i += length;
     }
@@ -81,9 +65,9 @@ void encodeKeyRuns(std::span<const uint64_t> keys, std::vector<uint8_t> &out) {
 void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<uint64_t> &keys) {
     uint64_t next = 0;
     for (size_t at = 0; at < bytes.size();) {
-        const uint64_t coded = takeNumber(bytes, at);
+        const uint64_t coded = vs::takePackedNumber(bytes, at);
         const uint64_t distance = (coded >> 1) ^ (0 - (coded & 1));
-        const uint64_t length = takeNumber(bytes, at);
+        const uint64_t length = vs::takePackedNumber(bytes, at);
         const uint64_t first = next + distance;
         for (uint64_t k = 0; k < length; ++k) {
             keys.push_back(first + k);

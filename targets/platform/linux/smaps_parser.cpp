@@ -1,5 +1,7 @@
 #include "targets/platform/linux/smaps_parser.h"
 
+#include "targets/platform/linux/packed_numbers.h"
+
 #include <algorithm>
 #include <array>
 #include <bit>
@@ -358,25 +360,7 @@ MappingKind mappingKind(const SmapsRegion &region, const std::vector<uint64_t> &
 
 namespace {
 
-void putNumber(std::vector<uint8_t> &out, uint64_t value) {
-    while (value >= 0x80) {
-        out.push_back(static_cast<uint8_t>(value | 0x80));
-        value >>= 7;
-    }
-    out.push_back(static_cast<uint8_t>(value));
-}
 
-uint64_t takeNumber(const std::vector<uint8_t> &bytes, size_t &at) {
-    uint64_t value = 0;
-    for (unsigned shift = 0; at < bytes.size() && shift < 64; shift += 7) {
-        const uint8_t byte = bytes[at++];
-        value |= uint64_t{byte & 0x7Fu} << shift;
-        if ((byte & 0x80) == 0) {
-            break;
-        }
-    }
-    return value;
-}
 
 // The counters of a region, in packing order.
 template <class Region, class Visit>
@@ -397,13 +381,13 @@ PackedSmapsRegions packSmapsRegions(const std::vector<SmapsRegion> &regions) {
     uint64_t previousEnd = 0;
     for (const SmapsRegion &r : regions) {
         // Mappings come in address order: the gap to the previous end is small.
-        putNumber(packed.bytes, r.start - previousEnd);
-        putNumber(packed.bytes, r.end - r.start);
-        putNumber(packed.bytes, r.offset);
-        putNumber(packed.bytes, r.inode);
-        putNumber(packed.bytes, r.devMajor);
-        putNumber(packed.bytes, r.devMinor);
-        putNumber(packed.bytes, (r.read ? 1u : 0u) | (r.write ? 2u : 0u) | (r.exec ? 4u : 0u) | (r.shared ? 8u : 0u) |
+        vs::putPackedNumber(packed.bytes, r.start - previousEnd);
+        vs::putPackedNumber(packed.bytes, r.end - r.start);
+        vs::putPackedNumber(packed.bytes, r.offset);
+        vs::putPackedNumber(packed.bytes, r.inode);
+        vs::putPackedNumber(packed.bytes, r.devMajor);
+        vs::putPackedNumber(packed.bytes, r.devMinor);
+        vs::putPackedNumber(packed.bytes, (r.read ? 1u : 0u) | (r.write ? 2u : 0u) | (r.exec ? 4u : 0u) | (r.shared ? 8u : 0u) |
                                     (r.hasVmFlags ? 16u : 0u));
         uint64_t pathIndex = 0; // 0: no path
         if (!r.path.empty()) {
@@ -420,9 +404,9 @@ PackedSmapsRegions packSmapsRegions(const std::vector<SmapsRegion> &regions) {
                 }
             }
         }
-        putNumber(packed.bytes, pathIndex);
-        forEachCounter(r, [&](const uint64_t &value) { putNumber(packed.bytes, value); });
-        putNumber(packed.bytes, r.vmFlags);
+        vs::putPackedNumber(packed.bytes, pathIndex);
+        forEachCounter(r, [&](const uint64_t &value) { vs::putPackedNumber(packed.bytes, value); });
+        vs::putPackedNumber(packed.bytes, r.vmFlags);
         previousEnd = r.end;
     }
     packed.bytes.shrink_to_fit();
@@ -436,24 +420,24 @@ void unpackSmapsRegions(const PackedSmapsRegions &packed, std::vector<SmapsRegio
     uint64_t previousEnd = 0;
     for (size_t i = 0; i < packed.count; ++i) {
         SmapsRegion r;
-        r.start = previousEnd + takeNumber(packed.bytes, at);
-        r.end = r.start + takeNumber(packed.bytes, at);
-        r.offset = takeNumber(packed.bytes, at);
-        r.inode = takeNumber(packed.bytes, at);
-        r.devMajor = static_cast<uint32_t>(takeNumber(packed.bytes, at));
-        r.devMinor = static_cast<uint32_t>(takeNumber(packed.bytes, at));
-        const uint64_t bits = takeNumber(packed.bytes, at);
+        r.start = previousEnd + vs::takePackedNumber(packed.bytes, at);
+        r.end = r.start + vs::takePackedNumber(packed.bytes, at);
+        r.offset = vs::takePackedNumber(packed.bytes, at);
+        r.inode = vs::takePackedNumber(packed.bytes, at);
+        r.devMajor = static_cast<uint32_t>(vs::takePackedNumber(packed.bytes, at));
+        r.devMinor = static_cast<uint32_t>(vs::takePackedNumber(packed.bytes, at));
+        const uint64_t bits = vs::takePackedNumber(packed.bytes, at);
         r.read = (bits & 1) != 0;
         r.write = (bits & 2) != 0;
         r.exec = (bits & 4) != 0;
         r.shared = (bits & 8) != 0;
         r.hasVmFlags = (bits & 16) != 0;
-        const uint64_t pathIndex = takeNumber(packed.bytes, at);
+        const uint64_t pathIndex = vs::takePackedNumber(packed.bytes, at);
         if (pathIndex != 0 && pathIndex <= packed.paths.size()) {
             r.path = packed.paths[pathIndex - 1];
         }
-        forEachCounter(r, [&](uint64_t &value) { value = takeNumber(packed.bytes, at); });
-        r.vmFlags = takeNumber(packed.bytes, at);
+        forEachCounter(r, [&](uint64_t &value) { value = vs::takePackedNumber(packed.bytes, at); });
+        r.vmFlags = vs::takePackedNumber(packed.bytes, at);
         previousEnd = r.end;
         regions.push_back(std::move(r));
     }
