@@ -2,6 +2,7 @@
 // what the kernel itself states in /proc/meminfo.
 
 #include <algorithm>
+#include <climits>
 #include <cstdlib>
 #include <array>
 #include <fstream>
@@ -43,11 +44,25 @@ TEST(KernelRun, KernelFiguresAndProcessesAddUpToTheMemoryInUse) {
     if (geteuid() != 0) GTEST_SKIP() << "the kernel's memory files are readable by root only";
     auto inUse = [] { return meminfoBytes("MemTotal") - meminfoBytes("MemFree"); };
     auto processes = [] { return meminfoBytes("AnonPages") + meminfoBytes("Mapped"); };
+    // What the rest of the machine does meanwhile shows as the spread of a
+    // few readings on either side of the run; that much is allowed.
+    int64_t noise = 0;
+    auto spread = [&noise, &inUse, &processes] {
+        int64_t low = INT64_MAX, high = INT64_MIN;
+        for (int i = 0; i < 5; ++i) {
+            const int64_t kernelShare = inUse() - processes();
+            low = std::min(low, kernelShare), high = std::max(high, kernelShare);
+            usleep(2000);
+        }
+        noise = std::max(noise, high - low);
+    };
+    spread();
     const int64_t usedBefore = inUse(), processesBefore = processes(), slabBefore = meminfoBytes("Slab"),
                   vmallocBefore = meminfoBytes("VmallocUsed");
     auto run = runProgram({"-p", "0", "-v", "-f", "bytes"});
     const int64_t usedAfter = inUse(), processesAfter = processes(), slabAfter = meminfoBytes("Slab"),
                   vmallocAfter = meminfoBytes("VmallocUsed");
+    spread();
     ASSERT_EQ(run.status, 0) << run.err;
     EXPECT_EQ(run.err, "");
 
@@ -89,7 +104,7 @@ TEST(KernelRun, KernelFiguresAndProcessesAddUpToTheMemoryInUse) {
     // room for that, a fixed share of the memory in use.
     const int64_t ownFootprint = std::max(usedBefore, usedAfter) / 200;
     const int64_t drift =
-        std::abs(usedAfter - usedBefore) + std::abs(processesAfter - processesBefore) + ownFootprint;
+        std::abs(usedAfter - usedBefore) + std::abs(processesAfter - processesBefore) + ownFootprint + 2 * noise;
     const int64_t low = std::min(usedBefore - processesBefore, usedAfter - processesAfter) - drift;
     const int64_t high = std::max(usedBefore - processesBefore, usedAfter - processesAfter) + drift;
     EXPECT_GE(kernel, low) << run.out;

@@ -100,7 +100,7 @@ TEST(LinuxRegionRecords, RecordFieldsFromSmaps) {
         EXPECT_EQ(info.swappedOutPages, c.swapped);
         EXPECT_EQ(info.userWiredCount, c.wired);
         const VSRegionBasicInfo basic = vs::basicInfoFor(region, kind, kPage);
-        EXPECT_EQ(std::make_tuple(basic.protection, basic.offset, basic.userWiredCount),
+        EXPECT_EQ(std::make_tuple(basic.protection, uint64_t{basic.offset}, basic.userWiredCount),
                   std::make_tuple(c.protection, c.offset, c.wired));
     }
 }
