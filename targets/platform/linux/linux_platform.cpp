@@ -924,7 +924,7 @@ void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, s
     constexpr uint64_t kGuard = 1ull << 58;
     constexpr uint64_t kExclusive = 1ull << 56;
     constexpr uint64_t kPfnMask = (1ull << 55) - 1;
-    _readPagemap(pagemapFd, region.start, region.size() / _pageSize,
+    _readPagemap(pagemapFd, region.start, region.size() / _pageSize, (region.rss + region.swap) / _pageSize,
                  [&](std::span<const uint64_t> entries, uint64_t) {
                      for (const uint64_t entry : entries) {
                          uint64_t key = 0;
@@ -972,7 +972,7 @@ constexpr uint64_t kMaxUnscannedPages = uint64_t{1} << 24;
 
 } // namespace
 
-bool VSLinuxPlatform::_readPagemap(int pagemapFd, uint64_t address, uint64_t pages,
+bool VSLinuxPlatform::_readPagemap(int pagemapFd, uint64_t address, uint64_t pages, uint64_t held,
                                    const std::function<bool(std::span<const uint64_t>, uint64_t)> &batch) {
     constexpr uint64_t kBatch = 16384; // 128 KiB of entries per read
     // One buffer per thread: fresh pages for every mapping cost more than
@@ -1001,12 +1001,17 @@ bool VSLinuxPlatform::_readPagemap(int pagemapFd, uint64_t address, uint64_t pag
         return true;
     };
 
+    bool failed = false;
+    // Mostly held: the scan would only walk the same page tables once more.
+    if (held * 2 >= pages) {
+        readPages(0, pages, failed);
+        return !failed;
+    }
     // A sparse mapping (a sanitizer's shadow, a runtime's reservation) can
     // span terabytes of which a few pages are there: read only those.
     const uint64_t end = address + pages * _pageSize;
     thread_local std::vector<PageRegion> populated;
     populated.resize(512);
-    bool failed = false;
     for (uint64_t at = address; at < end;) {
         PagemapScan scan{};
         scan.size = sizeof scan;
@@ -1101,7 +1106,7 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
         } else if (!whole) {
             pages.present.assign((pages.pageCount + 63) / 64, 0);
             pfns.clear();
-            _readPagemap(pagemap.get(), region.start, pages.pageCount,
+            _readPagemap(pagemap.get(), region.start, pages.pageCount, region.rss / _pageSize,
                          [&](std::span<const uint64_t> entries, uint64_t first) {
                              for (size_t k = 0; k < entries.size(); ++k) {
                                  if ((entries[k] & kPresent) != 0) {

@@ -125,8 +125,10 @@ private:
                         bool *framesUnreadable);
     // Reads pagemap entries of `pages` pages from `address` in large
     // batches; `batch` gets each with the index of its first page and
-    // returns false to stop. False when nothing could be read.
-    bool _readPagemap(int pagemapFd, uint64_t address, uint64_t pages,
+    // returns false to stop. `held` is how many pages the range holds by
+    // smaps: a range mostly held is read whole, a sparse one only where it
+    // holds pages. False when nothing could be read.
+    bool _readPagemap(int pagemapFd, uint64_t address, uint64_t pages, uint64_t held,
                       const std::function<bool(std::span<const uint64_t>, uint64_t)> &batch);
     // Dirty bits of present frames (pfns in page order), from kpageflags.
     void _dirtyFrames(const std::vector<uint64_t> &pfns, const std::vector<uint64_t> &present,
