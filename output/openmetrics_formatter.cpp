@@ -124,14 +124,15 @@ void VSOutputFormatterOpenMetrics::end() {
             sample(out, "vestage_process_swapped_bytes", p.labels, p.swapped);
         }
     }
-    family(out, "vestage_summary_bytes",
+    // Not "summary": scrapers reserve the word for a metric type.
+    family(out, "vestage_all_targets_bytes",
            "All targets together, every memory object once: bytes by column (vestage is dirty plus swapped).");
     const std::pair<const char *, std::uint64_t> columns[] = {
         {"vestage", _summary.dirty + _summary.swapped}, {"dirty", _summary.dirty}, {"swapped", _summary.swapped},
         {"clean", _summary.clean}, {"reclaimable", _summary.reclaimable}, {"wired", _summary.wired},
     };
     for (const auto &[column, value] : columns) {
-        sample(out, "vestage_summary_bytes", std::string("column=\"") + column + "\"", value);
+        sample(out, "vestage_all_targets_bytes", std::string("column=\"") + column + "\"", value);
     }
     if (!_kernel.empty()) {
         family(out, "vestage_kernel_bytes", "The kernel's memory by category and column.");

@@ -6,8 +6,8 @@ set -euo pipefail
 # `setup.sh tests` adds what the tests need.
 packages=(g++ make cmake pkg-config libbsd-dev nlohmann-json3-dev)
 if [ "${1:-}" = tests ]; then
-    # python3-prometheus-client: a real OpenMetrics parser for the tests.
-    packages+=(googletest libgtest-dev python3-prometheus-client)
+    # A real OpenMetrics parser and promtool's metrics lint for the tests.
+    packages+=(googletest libgtest-dev python3-prometheus-client prometheus)
 fi
 
 missing=()
