@@ -213,24 +213,31 @@ std::optional<uint32_t> SharedPageIndex::sharedSet(uint64_t key) const {
 void SharedPageIndex::sharedSets(std::span<const uint64_t> keys, std::vector<uint32_t> &sets) const {
     sets.assign(keys.size(), kNoSet);
     const bool frozen = _frozen.load();
-    std::unique_lock<std::mutex> setsLock(_mutex, std::defer_lock);
-    if (!frozen) {
-        setsLock.lock();
-    }
     uint64_t lastBlock = UINT64_MAX;
     const uint32_t *lanes = nullptr;
     for (size_t i = 0; i < keys.size(); ++i) {
         Shard &shard = _shards[_shardOf(keys[i])];
-        std::unique_lock<std::mutex> lock(shard.mutex, std::defer_lock);
-        if (!frozen) {
-            lock.lock();
-            lastBlock = UINT64_MAX; // another thread may have moved the block
+        uint32_t set = 0;
+        if (frozen) {
+            if ((keys[i] >> kBlockShift) != lastBlock) {
+                lastBlock = keys[i] >> kBlockShift;
+                lanes = shard.pages.find(lastBlock);
+            }
+            set = lanes == nullptr ? 0 : lanes[keys[i] & (PageTable::kLanes - 1)];
+            if (_sets[set].size() >= 2) {
+                sets[i] = set;
+            }
+            continue;
         }
-        if ((keys[i] >> kBlockShift) != lastBlock) {
-            lastBlock = keys[i] >> kBlockShift;
-            lanes = shard.pages.find(lastBlock);
+        // While pages are still added: the shard's lock, then the sets'
+        // lock, one after the other, never both (adding takes them nested
+        // the other way round).
+        {
+            std::lock_guard<std::mutex> lock(shard.mutex);
+            const uint32_t *found = shard.pages.find(keys[i] >> kBlockShift);
+            set = found == nullptr ? 0 : found[keys[i] & (PageTable::kLanes - 1)];
         }
-        const uint32_t set = lanes == nullptr ? 0 : lanes[keys[i] & (PageTable::kLanes - 1)];
+        std::lock_guard<std::mutex> lock(_mutex);
         if (_sets[set].size() >= 2) {
             sets[i] = set;
         }
