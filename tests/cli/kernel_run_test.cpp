@@ -108,9 +108,9 @@ TEST(KernelRun, KernelFiguresAndProcessesAddUpToTheMemoryInUse) {
     // The run itself holds kernel memory while it reads (its page tables,
     // slab objects of its open files) that neither reading sees: a little
     // room for that, a fixed share of the memory in use.
-    const int64_t ownFootprint = std::max(usedBefore, usedAfter) / 200;
+    const int64_t runOwnMemory = std::max(usedBefore, usedAfter) / 200;
     const int64_t drift =
-        std::abs(usedAfter - usedBefore) + std::abs(processesAfter - processesBefore) + ownFootprint + 2 * noise;
+        std::abs(usedAfter - usedBefore) + std::abs(processesAfter - processesBefore) + runOwnMemory + 2 * noise;
     const int64_t low = std::min(usedBefore - processesBefore, usedAfter - processesAfter) - drift;
     const int64_t high = std::max(usedBefore - processesBefore, usedAfter - processesAfter) + drift;
     EXPECT_GE(kernel, low) << run.out;
@@ -129,7 +129,7 @@ TEST(KernelRun, KernelFiguresAndProcessesAddUpToTheMemoryInUse) {
             vmalloc += figures[0];
         }
     }
-    const int64_t slabDrift = std::abs(slabAfter - slabBefore) + ownFootprint;
+    const int64_t slabDrift = std::abs(slabAfter - slabBefore) + runOwnMemory;
     EXPECT_GE(static_cast<int64_t>(slab), std::min(slabBefore, slabAfter) - slabDrift);
     EXPECT_LE(static_cast<int64_t>(slab), std::max(slabBefore, slabAfter) + slabDrift);
     if (vmallocBefore > 0 && vmallocAfter > 0) {

@@ -104,7 +104,7 @@ TEST(SharedPageIndex, AnObjectHoldsTheUnionOfItsMappingsPages) {
         const auto pages = index.objectPages(1, 2, c.first, c.count);
         ASSERT_EQ(pages.has_value(), c.pages.has_value());
         if (pages) {
-            EXPECT_EQ(std::make_pair(pages->resident, pages->dirty), *c.pages);
+            EXPECT_EQ(std::make_pair(pages->residentPages, pages->dirtyPages), *c.pages);
         }
     }
 }

@@ -231,14 +231,14 @@ std::vector<ProcessImage> processImages(const std::vector<SmapsRegion> &regions,
     std::set<std::pair<uint64_t, uint64_t>> executableFiles;
     for (const SmapsRegion &region : regions) {
         if (region.exec && region.inode != 0) {
-            executableFiles.emplace((uint64_t{region.devMajor} << 32) | region.devMinor, region.inode);
+            executableFiles.emplace(deviceNumber(region.devMajor, region.devMinor), region.inode);
         }
     }
     for (const SmapsRegion &region : regions) {
         if (region.inode == 0 || region.path.empty() || region.path[0] != '/') {
             continue;
         }
-        const uint64_t device = (uint64_t{region.devMajor} << 32) | region.devMinor;
+        const uint64_t device = deviceNumber(region.devMajor, region.devMinor);
         if (executableFiles.count({device, region.inode}) == 0) {
             continue;
         }

@@ -79,7 +79,6 @@ struct VSLinuxPlatform::Task {
     std::vector<uint8_t> storedBytes;
     // A prepared parse waiting for the run is held packed (a run holds
     // every waiting target's at once); the first region query unpacks it.
-    bool isPacked = false;
     vs::PackedSmapsRegions packed;
     // The status read for the kernel-memory counters, kept for the one
     // resource-usage query that a target makes right after it (both are
@@ -91,6 +90,15 @@ namespace {
 
 // Kernel stack of one thread (THREAD_SIZE) on the architectures we build for.
 constexpr uint64_t kKernelStackSize = 16 * 1024;
+
+// A pagemap entry (8 bytes per page) and a kpageflags word.
+constexpr uint64_t kPagemapPresent = 1ull << 63;
+constexpr uint64_t kPagemapSwapped = 1ull << 62;
+constexpr uint64_t kPagemapFileOrSharedAnon = 1ull << 61;
+constexpr uint64_t kPagemapGuard = 1ull << 58; // a guard marker, which also sets "swapped"
+constexpr uint64_t kPagemapExclusive = 1ull << 56;
+constexpr uint64_t kPagemapPfnMask = (1ull << 55) - 1;
+constexpr uint64_t kPageFlagDirty = 1ull << 4; // KPF_DIRTY
 
 // Region queries keep 1 and 4 for their own meanings, so the two errnos with
 // those numbers are reported as their nearest neighbours.
@@ -159,10 +167,6 @@ std::vector<uint64_t> threadStackPointers(int dirFd) {
     return pointers;
 }
 
-uint64_t deviceNumber(uint32_t majorNumber, uint32_t minorNumber) {
-    return (uint64_t{majorNumber} << 32) | minorNumber;
-}
-
 // Reads bytes of a file another process maps, opened through `name` under
 // `dirFd`. The open can neither block on a FIFO nor take a terminal, and
 // whatever it reaches must be the regular file (device, inode) the process
@@ -177,7 +181,7 @@ int64_t readFileOfProcess(int dirFd, const char *name, int flags, uint64_t devic
     if (::fstat(fd.get(), &st) != 0) {
         return -errno;
     }
-    if (!S_ISREG(st.st_mode) || st.st_ino != inode || deviceNumber(major(st.st_dev), minor(st.st_dev)) != device) {
+    if (!S_ISREG(st.st_mode) || st.st_ino != inode || vs::deviceNumber(major(st.st_dev), minor(st.st_dev)) != device) {
         return -ENOENT;
     }
     size_t done = 0;
@@ -217,7 +221,6 @@ struct MappedFileContext {
 // the process does not hold all the pages asked for.
 int64_t readFileFromMemory(MappedFileContext &c, const SmapsRegion &file, uint64_t offset, void *out,
                            size_t size) {
-    constexpr uint64_t kPresent = 1ull << 63;
     for (const SmapsRegion &mapping : c.regions) {
         if (mapping.inode != file.inode || mapping.devMajor != file.devMajor ||
             mapping.devMinor != file.devMinor || offset < mapping.offset ||
@@ -242,7 +245,7 @@ int64_t readFileFromMemory(MappedFileContext &c, const SmapsRegion &file, uint64
             return n < 0 ? -errno : -ENODATA;
         }
         for (uint64_t entry : entries) {
-            if ((entry & kPresent) == 0) {
+            if ((entry & kPagemapPresent) == 0) {
                 return -ENODATA;
             }
         }
@@ -265,7 +268,7 @@ int64_t readMappedFile(void *context, const SmapsRegion &region, uint64_t offset
     if (fromMemory != -ENODATA) {
         return fromMemory;
     }
-    const uint64_t device = deviceNumber(region.devMajor, region.devMinor);
+    const uint64_t device = vs::deviceNumber(region.devMajor, region.devMinor);
     const auto openable = c.openableDevices.find(device);
     if (openable == c.openableDevices.end() || !openable->second) {
         return -EAGAIN; // not worth remembering: another process may hold the pages
@@ -447,7 +450,7 @@ int32_t VSLinuxPlatform::pid_bsd_info(int32_t pid, VSBsdInfo &info) {
     // asked about the file; its device tells whether it may be opened.
     struct statx exe {};
     if (::statx(dirFd, "exe", AT_STATX_DONT_SYNC, STATX_TYPE | STATX_INO, &exe) == 0 && S_ISREG(exe.stx_mode)) {
-        const uint64_t device = deviceNumber(exe.stx_dev_major, exe.stx_dev_minor);
+        const uint64_t device = vs::deviceNumber(exe.stx_dev_major, exe.stx_dev_minor);
         const auto openable = _openableDevices().find(device);
         if (openable != _openableDevices().end() && openable->second) {
             struct ExeContext {
@@ -861,41 +864,39 @@ void VSLinuxPlatform::_buildParts(Task &task) {
             if (stored != task.storedKeys.end()) {
                 vs::decodeKeyRuns(std::span<const uint8_t>(task.storedBytes.data() + stored->begin, stored->length),
                                   keys);
-            } else if (!pagemap.valid()) {
-                pagemap = UniqueFd(::openat(task.dir.get(), "pagemap", O_RDONLY | O_CLOEXEC));
-                pagemapFailed = !pagemap.valid();
-            }
-            if (stored != task.storedKeys.end() || pagemap.valid()) {
-                if (stored == task.storedKeys.end()) {
+            } else {
+                if (!pagemap.valid()) {
+                    pagemap = UniqueFd(::openat(task.dir.get(), "pagemap", O_RDONLY | O_CLOEXEC));
+                    pagemapFailed = !pagemap.valid();
+                }
+                if (pagemap.valid()) {
                     _candidateKeys(pagemap.get(), region, keys, nullptr);
                 }
-                _sharedPages.sharedSets(keys, sets);
-                // Counted by set first; a region meets few sets.
-                std::vector<std::pair<uint32_t, vs::SharedAnonymousPart>> bySet;
-                for (size_t k = 0; k < keys.size(); ++k) {
-                    if (sets[k] == vs::SharedPageIndex::kNoSet) {
-                        continue; // no other target maps it: the mapping's own
-                    }
-                    auto set = bySet.begin();
-                    while (set != bySet.end() && set->first != sets[k]) {
-                        ++set;
-                    }
-                    if (set == bySet.end()) {
-                        set = bySet.insert(bySet.end(), {sets[k], vs::SharedAnonymousPart{}});
-                    }
-                    ((keys[k] & vs::kSwapKey) != 0 ? set->second.swappedPages : set->second.presentPages) += 1;
+            }
+            _sharedPages.sharedSets(keys, sets);
+            // Counted by set first; a region meets few sets.
+            std::vector<std::pair<uint32_t, vs::SharedAnonymousPart>> bySet;
+            for (size_t k = 0; k < keys.size(); ++k) {
+                if (sets[k] == vs::SharedPageIndex::kNoSet) {
+                    continue; // no other target maps it: the mapping's own
                 }
-                for (auto &[set, part] : bySet) {
-                    part.objectId = ids.idForFrameSet(set, region.start);
-                    shared.push_back(part);
+                auto set = bySet.begin();
+                while (set != bySet.end() && set->first != sets[k]) {
+                    ++set;
                 }
+                if (set == bySet.end()) {
+                    set = bySet.insert(bySet.end(), {sets[k], vs::SharedAnonymousPart{}});
+                }
+                ((keys[k] & vs::kSwapKey) != 0 ? set->second.swappedPages : set->second.presentPages) += 1;
+            }
+            for (auto &[set, part] : bySet) {
+                part.objectId = ids.idForFrameSet(set, region.start);
+                shared.push_back(part);
             }
         } else if (resolved && _isSharedWindow(region, kind)) {
             const uint64_t first = region.offset / _pageSize;
-            if (auto pages = _sharedPages.objectPages(deviceNumber(region.devMajor, region.devMinor), region.inode, first,
-                                                      region.size() / _pageSize)) {
-                objectPages = vs::ObjectPages{pages->resident, pages->dirty};
-            }
+            const uint64_t device = vs::deviceNumber(region.devMajor, region.devMinor);
+            objectPages = _sharedPages.objectPages(device, region.inode, first, region.size() / _pageSize);
         }
         task.firstPart.push_back(static_cast<uint32_t>(task.parts.size()));
         for (VSRegionInfo &part : vs::regionPartsFor(region, kind, task.tags[i], ids, _pageSize, shared, objectPages)) {
@@ -918,25 +919,19 @@ bool VSLinuxPlatform::_isSharedWindow(const SmapsRegion &region, vs::MappingKind
 
 void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, std::vector<uint64_t> &keys,
                                      bool *framesUnreadable) {
-    constexpr uint64_t kPresent = 1ull << 63;
-    constexpr uint64_t kSwapped = 1ull << 62;
-    constexpr uint64_t kFileOrSharedAnon = 1ull << 61;
-    constexpr uint64_t kGuard = 1ull << 58;
-    constexpr uint64_t kExclusive = 1ull << 56;
-    constexpr uint64_t kPfnMask = (1ull << 55) - 1;
     _readPagemap(pagemapFd, region.start, region.size() / _pageSize, (region.rss + region.swap) / _pageSize,
                  [&](std::span<const uint64_t> entries, uint64_t) {
                      for (const uint64_t entry : entries) {
                          uint64_t key = 0;
-                         if ((entry & kPresent) != 0) {
+                         if ((entry & kPagemapPresent) != 0) {
                              // Page cache of a file mapping, and pages only
                              // this process maps, are never in a set.
-                             if ((entry & (kFileOrSharedAnon | kExclusive)) != 0) {
+                             if ((entry & (kPagemapFileOrSharedAnon | kPagemapExclusive)) != 0) {
                                  continue;
                              }
-                             key = entry & kPfnMask;
-                         } else if ((entry & kSwapped) != 0 && (entry & kGuard) == 0) {
-                             key = (entry & kPfnMask) == 0 ? 0 : (vs::kSwapKey | (entry & kPfnMask));
+                             key = entry & kPagemapPfnMask;
+                         } else if ((entry & kPagemapSwapped) != 0 && (entry & kPagemapGuard) == 0) {
+                             key = (entry & kPagemapPfnMask) == 0 ? 0 : (vs::kSwapKey | (entry & kPagemapPfnMask));
                          } else {
                              continue;
                          }
@@ -1057,11 +1052,9 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
     if (_ensureParsed(*task) != 0 || task->prepared || _sharedPagesResolved.load()) {
         return task->prepared;
     }
-    constexpr uint64_t kPresent = 1ull << 63;
-    constexpr uint64_t kPfnMask = (1ull << 55) - 1;
     UniqueFd pagemap;
     thread_local std::vector<uint64_t> keys;
-    std::vector<uint64_t> pfns;
+    std::vector<std::pair<uint64_t, uint64_t>> frames; // frame, page of the mapping
     bool framesUnreadable = false;
     bool any = false;
     for (size_t i = 0; i < task->regions.size(); ++i) {
@@ -1094,7 +1087,7 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
         // A shared mapping: which file pages it holds, and which of them are
         // dirty (shmem pages are all dirty; page cache says per frame).
         vs::SharedPageIndex::Window pages;
-        pages.device = deviceNumber(region.devMajor, region.devMinor);
+        pages.device = vs::deviceNumber(region.devMajor, region.devMinor);
         pages.inode = region.inode;
         pages.firstPage = region.offset / _pageSize;
         pages.pageCount = region.size() / _pageSize;
@@ -1105,19 +1098,20 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
             pages.present.assign(1, 0);
         } else if (!whole) {
             pages.present.assign((pages.pageCount + 63) / 64, 0);
-            pfns.clear();
+            frames.clear();
             _readPagemap(pagemap.get(), region.start, pages.pageCount, region.rss / _pageSize,
                          [&](std::span<const uint64_t> entries, uint64_t first) {
                              for (size_t k = 0; k < entries.size(); ++k) {
-                                 if ((entries[k] & kPresent) != 0) {
+                                 if ((entries[k] & kPagemapPresent) != 0) {
                                      pages.present[(first + k) / 64] |= 1ull << ((first + k) % 64);
-                                     pfns.push_back(entries[k] & kPfnMask);
+                                     frames.emplace_back(entries[k] & kPagemapPfnMask, first + k);
                                  }
                              }
                              return true;
                          });
-            if (!shmem && !pfns.empty() && pfns.front() != 0) {
-                _dirtyFrames(pfns, pages.present, pages.dirty);
+            if (!shmem && !frames.empty() && frames.front().first != 0) {
+                pages.dirty.assign(pages.present.size(), 0);
+                _forEachDirtyFrame(frames, [&](uint64_t page) { pages.dirty[page / 64] |= 1ull << (page % 64); });
             }
         }
         if (shmem) {
@@ -1141,44 +1135,43 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
     if (any) {
         task->packed = vs::packSmapsRegions(task->regions);
         std::vector<SmapsRegion>().swap(task->regions);
-        task->isPacked = true;
     }
     return any;
 }
 
-void VSLinuxPlatform::_dirtyFrames(const std::vector<uint64_t> &pfns, const std::vector<uint64_t> &present,
-                                   std::vector<uint64_t> &dirty) {
-    // Neighbouring pages of a file often sit in neighbouring frames: one
-    // read serves a run of them.
+void VSLinuxPlatform::_forEachDirtyFrame(std::vector<std::pair<uint64_t, uint64_t>> &frames,
+                                         const std::function<void(uint64_t)> &dirty) {
     std::call_once(_kpageflagsOnce, [this] {
         _kpageflagsFd = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC);
     });
-    if (_kpageflagsFd < 0) {
+    if (_kpageflagsFd < 0 || frames.empty()) {
         return;
     }
-    constexpr uint64_t kDirtyPageFlag = 1ull << 4;
-    constexpr size_t kRun = 64;
-    dirty.assign(present.size(), 0);
-    std::vector<uint64_t> pages; // page index of each pfn, in page order
-    for (uint64_t page = 0; page < present.size() * 64 && pages.size() < pfns.size(); ++page) {
-        if ((present[page / 64] >> (page % 64) & 1) != 0) {
-            pages.push_back(page);
+    // Read in runs of nearby frames: pages written together sit together.
+    std::sort(frames.begin(), frames.end());
+    constexpr uint64_t kMaxRun = 512;
+    thread_local std::vector<uint64_t> flags;
+    flags.resize(kMaxRun);
+    size_t i = 0;
+    while (i < frames.size()) {
+        const uint64_t runStart = frames[i].first;
+        size_t j = i;
+        while (j + 1 < frames.size() && frames[j + 1].first - runStart < kMaxRun) {
+            ++j;
         }
-    }
-    uint64_t flags[kRun];
-    for (size_t i = 0; i < pages.size();) {
-        size_t length = 1;
-        while (i + length < pages.size() && length < kRun && pfns[i + length] == pfns[i] + length) {
-            ++length;
-        }
-        const ssize_t n = ::pread(_kpageflagsFd, flags, length * sizeof(uint64_t),
-                                  static_cast<off_t>(pfns[i] * sizeof(uint64_t)));
-        for (size_t k = 0; n > 0 && k < static_cast<size_t>(n) / sizeof(uint64_t); ++k) {
-            if ((flags[k] & kDirtyPageFlag) != 0) {
-                dirty[pages[i + k] / 64] |= 1ull << (pages[i + k] % 64);
+        const uint64_t runLength = frames[j].first - runStart + 1;
+        const ssize_t n = ::pread(_kpageflagsFd, flags.data(), runLength * sizeof(uint64_t),
+                                  static_cast<off_t>(runStart * sizeof(uint64_t)));
+        if (n > 0) {
+            const uint64_t got = static_cast<uint64_t>(n) / sizeof(uint64_t);
+            for (size_t k = i; k <= j; ++k) {
+                const uint64_t at = frames[k].first - runStart;
+                if (at < got && (flags[at] & kPageFlagDirty) != 0) {
+                    dirty(frames[k].second);
+                }
             }
         }
-        i += length;
+        i = j + 1;
     }
 }
 
@@ -1191,7 +1184,6 @@ bool VSLinuxPlatform::resolve_shared_pages() {
 void VSLinuxPlatform::_releaseParse(Task &task) {
     std::vector<SmapsRegion>().swap(task.regions);
     task.packed = vs::PackedSmapsRegions{};
-    task.isPacked = false;
     std::vector<vs::MappingKind>().swap(task.kinds);
     std::vector<uint32_t>().swap(task.tags);
     std::vector<VSRegionInfo>().swap(task.parts);
@@ -1206,10 +1198,9 @@ VSReturnCode VSLinuxPlatform::_ensureParsed(Task &task) {
         task.parseCode = _parse(task);
         task.parsed = true;
     }
-    if (task.isPacked) {
+    if (task.packed.count != 0) {
         vs::unpackSmapsRegions(task.packed, task.regions);
         task.packed = vs::PackedSmapsRegions{};
-        task.isPacked = false;
     }
     return task.parseCode;
 }
@@ -1330,16 +1321,6 @@ VSReturnCode VSLinuxPlatform::page_range_query(VSTaskHandle handle, uint64_t add
     }
     UniqueFd pagemapFd(pagemap);
 
-    std::call_once(_kpageflagsOnce, [this] {
-        _kpageflagsFd = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC);
-    });
-
-    constexpr uint64_t kPresent = 1ull << 63;
-    constexpr uint64_t kSwapped = 1ull << 62;
-    constexpr uint64_t kFileOrSharedAnon = 1ull << 61;
-    constexpr uint64_t kGuard = 1ull << 58;
-    constexpr uint64_t kPfnMask = (1ull << 55) - 1;
-    constexpr uint64_t kDirtyPageFlag = 1ull << 4; // KPF_DIRTY
     constexpr uint64_t kBatch = 4096;
 
     std::vector<uint64_t> entries(std::min(pages, kBatch));
@@ -1362,19 +1343,19 @@ VSReturnCode VSLinuxPlatform::page_range_query(VSTaskHandle handle, uint64_t add
             const uint64_t entry = entries[k];
             const uint64_t page = first + index * _pageSize;
             int32_t word = 0;
-            if ((entry & kGuard) != 0) {
+            if ((entry & kPagemapGuard) != 0) {
                 dispositions[index] = 0; // a guard marker holds no page
                 continue;
             }
-            if ((entry & kPresent) != 0) {
+            if ((entry & kPagemapPresent) != 0) {
                 word |= vs::kPageDispositionPresent;
-                if ((entry & kPfnMask) != 0) {
-                    presentPfns.emplace_back(entry & kPfnMask, index);
+                if ((entry & kPagemapPfnMask) != 0) {
+                    presentPfns.emplace_back(entry & kPagemapPfnMask, index);
                 }
-            } else if ((entry & kSwapped) != 0) {
+            } else if ((entry & kPagemapSwapped) != 0) {
                 word |= vs::kPageDispositionPagedOut;
             }
-            if ((entry & kFileOrSharedAnon) != 0) {
+            if ((entry & kPagemapFileOrSharedAnon) != 0) {
                 bool external = !haveRegions;
                 while (fileIndex < fileRanges.size() && fileRanges[fileIndex].second <= page) {
                     ++fileIndex;
@@ -1398,33 +1379,7 @@ VSReturnCode VSLinuxPlatform::page_range_query(VSTaskHandle handle, uint64_t add
         }
     }
 
-    // Dirty bits come from the page frames, read in runs of nearby frames.
-    if (_kpageflagsFd >= 0 && !presentPfns.empty()) {
-        std::sort(presentPfns.begin(), presentPfns.end());
-        constexpr uint64_t kMaxRun = 512;
-        std::vector<uint64_t> flags(kMaxRun);
-        size_t i = 0;
-        while (i < presentPfns.size()) {
-            const uint64_t runStart = presentPfns[i].first;
-            size_t j = i;
-            while (j + 1 < presentPfns.size() && presentPfns[j + 1].first - runStart < kMaxRun) {
-                ++j;
-            }
-            const uint64_t runLength = presentPfns[j].first - runStart + 1;
-            const ssize_t n = ::pread(_kpageflagsFd, flags.data(), runLength * sizeof(uint64_t),
-                                      static_cast<off_t>(runStart * sizeof(uint64_t)));
-            if (n > 0) {
-                const uint64_t got = static_cast<uint64_t>(n) / sizeof(uint64_t);
-                for (size_t k = i; k <= j; ++k) {
-                    const uint64_t at = presentPfns[k].first - runStart;
-                    if (at < got && (flags[at] & kDirtyPageFlag) != 0) {
-                        dispositions[presentPfns[k].second] |= vs::kPageDispositionDirty;
-                    }
-                }
-            }
-            i = j + 1;
-        }
-    }
+    _forEachDirtyFrame(presentPfns, [&](uint64_t index) { dispositions[index] |= vs::kPageDispositionDirty; });
     count = pages;
     return 0;
 }

@@ -130,9 +130,10 @@ private:
     // holds pages. False when nothing could be read.
     bool _readPagemap(int pagemapFd, uint64_t address, uint64_t pages, uint64_t held,
                       const std::function<bool(std::span<const uint64_t>, uint64_t)> &batch);
-    // Dirty bits of present frames (pfns in page order), from kpageflags.
-    void _dirtyFrames(const std::vector<uint64_t> &pfns, const std::vector<uint64_t> &present,
-                      std::vector<uint64_t> &dirty);
+    // Calls `dirty` with the index paired with every frame kpageflags marks
+    // dirty; `frames` holds (frame, index) pairs and is sorted on the way.
+    void _forEachDirtyFrame(std::vector<std::pair<uint64_t, uint64_t>> &frames,
+                            const std::function<void(uint64_t)> &dirty);
     // The mount table, read once: tmpfs devices, and which devices hold
     // file systems whose files may be opened for a header probe.
     void _readMounts();

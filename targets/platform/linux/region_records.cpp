@@ -114,10 +114,6 @@ uint32_t pagesOf(uint64_t count) {
     return count > UINT32_MAX ? UINT32_MAX : static_cast<uint32_t>(count);
 }
 
-uint64_t deviceOf(const SmapsRegion &region) {
-    return (uint64_t{region.devMajor} << 32) | region.devMinor;
-}
-
 // The fields every part of a mapping has in common.
 VSRegionInfo commonRecord(const SmapsRegion &region, uint32_t userTag) {
     VSRegionInfo info;
@@ -172,13 +168,14 @@ std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind 
                                          const std::vector<SharedAnonymousPart> &shared,
                                          const std::optional<ObjectPages> &objectPages) {
     const VSRegionInfo common = commonRecord(region, userTag);
+    const uint64_t device = deviceNumber(region.devMajor, region.devMinor);
     const auto pages = [pageSize](uint64_t bytes) { return bytes / pageSize; };
     std::vector<VSRegionInfo> parts;
 
     if (region.hasFlag(kVmHugetlb)) {
         // Hugetlb pages cannot be dropped or swapped; Rss leaves them out.
         const uint64_t resident = pages(region.privateHugetlb + region.sharedHugetlb);
-        const uint32_t id = region.shared && region.inode != 0 ? ids.idForFile(deviceOf(region), region.inode)
+        const uint32_t id = region.shared && region.inode != 0 ? ids.idForFile(device, region.inode)
                                                                : ids.freshId();
         parts.push_back(part(common, region, id, region.shared ? region.offset : 0, {resident, resident, 0, 0},
                              false, region.shared ? kShareModeShared : kShareModePrivate));
@@ -196,7 +193,7 @@ std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind 
     const bool droppable = kind == MappingKind::File;
     if (region.shared) {
         // Every page of a shared mapping is the object's own page.
-        const uint32_t id = region.inode != 0 ? ids.idForFile(deviceOf(region), region.inode) : ids.freshId();
+        const uint32_t id = region.inode != 0 ? ids.idForFile(device, region.inode) : ids.freshId();
         PartPages counts{pages(region.rss), pages(region.privateDirty + region.sharedDirty), pages(region.swap),
                          pages(region.lazyFree)};
         if (objectPages) {
@@ -230,7 +227,7 @@ std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind 
         // anonymous page but a lazily freed one is dirty.
         const uint64_t fileDirty =
             clampedDifference(pages(region.privateDirty + region.sharedDirty), clampedDifference(anonymous, lazyFree));
-        const uint32_t id = ids.idForFileWindow(deviceOf(region), region.inode, region.offset);
+        const uint32_t id = ids.idForFileWindow(device, region.inode, region.offset);
         if (filePages > 0 || ownPresent + ownSwapped + sharedPresent + sharedSwapped == 0) {
             parts.push_back(part(common, region, id, region.offset, {filePages, fileDirty, 0, 0}, droppable,
                                  kShareModeShared));

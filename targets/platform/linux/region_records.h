@@ -5,6 +5,7 @@
 // here from what smaps tells, in one place, so that the walk and the tests
 // agree on every rule.
 
+#include "targets/platform/linux/shared_pages.h"
 #include "targets/platform/linux/smaps_parser.h"
 #include "targets/platform/platform.h"
 
@@ -27,14 +28,6 @@ struct SharedAnonymousPart {
     uint32_t objectId = 0;   // the set's object at this address
     uint64_t presentPages = 0;
     uint64_t swappedPages = 0;
-};
-
-// The whole object's pages within a shared mapping's range, where several
-// mappings of the object hold different pages (the union of what they
-// have resident), replacing the mapping's own counts.
-struct ObjectPages {
-    uint64_t residentPages = 0;
-    uint64_t dirtyPages = 0;
 };
 
 // Does the mapping hold anonymous pages that may be mapped by other

@@ -267,7 +267,7 @@ void SharedPageIndex::addWindow(const Window &window) {
     }
 }
 
-std::optional<SharedPageIndex::Pages> SharedPageIndex::objectPages(uint64_t device, uint64_t inode,
+std::optional<ObjectPages> SharedPageIndex::objectPages(uint64_t device, uint64_t inode,
                                                                    uint64_t firstPage, uint64_t pageCount) const {
     std::lock_guard<std::mutex> lock(_mutex);
     const auto found = _objects.find({device, inode});
@@ -275,11 +275,11 @@ std::optional<SharedPageIndex::Pages> SharedPageIndex::objectPages(uint64_t devi
         return std::nullopt;
     }
     const ObjectBits &object = found->second;
-    Pages pages;
-    pages.resident = countBits(object.present, firstPage, pageCount);
+    ObjectPages pages;
+    pages.residentPages = countBits(object.present, firstPage, pageCount);
     // Where no mapping could read dirty bits, the most any one saw dirty
     // is the best lower bound there is.
-    pages.dirty = std::min(pages.resident,
+    pages.dirtyPages = std::min(pages.residentPages,
                            std::max(countBits(object.dirty, firstPage, pageCount), object.unknownDirty));
     return pages;
 }

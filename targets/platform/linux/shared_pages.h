@@ -37,6 +37,14 @@ void encodeKeyRuns(std::span<const uint64_t> keys, std::vector<uint8_t> &out);
 // Appends the keys of `bytes` (as encodeKeyRuns wrote them) to `keys`.
 void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<uint64_t> &keys);
 
+// The whole object's pages within a shared mapping's range, where several
+// mappings of the object hold different pages (the union of what they
+// have resident), replacing the mapping's own counts.
+struct ObjectPages {
+    uint64_t residentPages = 0;
+    uint64_t dirtyPages = 0;
+};
+
 class SharedPageIndex {
 public:
     // The pages of a target that other targets may map too (keys as
@@ -71,11 +79,7 @@ public:
     // The object's pages within [firstPage, firstPage + pageCount): how
     // many any mapping holds and how many of those are dirty. nullopt when
     // one mapping alone maps the object (its own counts are exact).
-    struct Pages {
-        uint64_t resident = 0;
-        uint64_t dirty = 0;
-    };
-    std::optional<Pages> objectPages(uint64_t device, uint64_t inode, uint64_t firstPage,
+    std::optional<ObjectPages> objectPages(uint64_t device, uint64_t inode, uint64_t firstPage,
                                      uint64_t pageCount) const;
 
     // No page is added from now on: lookups need no locks.

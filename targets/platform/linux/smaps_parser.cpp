@@ -351,7 +351,7 @@ MappingKind mappingKind(const SmapsRegion &region, const std::vector<uint64_t> &
         startsWith(path, "[anon_shmem:")) {
         return MappingKind::SharedMemory;
     }
-    const uint64_t device = (static_cast<uint64_t>(region.devMajor) << 32) | region.devMinor;
+    const uint64_t device = deviceNumber(region.devMajor, region.devMinor);
     if (std::find(tmpfsDevices.begin(), tmpfsDevices.end(), device) != tmpfsDevices.end()) {
         return MappingKind::SharedMemory;
     }

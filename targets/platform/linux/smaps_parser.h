@@ -90,6 +90,11 @@ struct SmapsRegion {
 // returns the number appended. Never fails: unparseable lines are skipped.
 size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out);
 
+// A device as one number, major above minor, as the layer keys files.
+inline uint64_t deviceNumber(uint32_t majorNumber, uint32_t minorNumber) {
+    return (uint64_t{majorNumber} << 32) | minorNumber;
+}
+
 // Parsed regions kept small while they wait (a run holds every target's
 // parse until the pages they share are known): variable-length numbers,
 // each distinct path once. unpackSmapsRegions gives back exactly what was
