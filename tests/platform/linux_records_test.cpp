@@ -220,9 +220,13 @@ TEST(LinuxObjectIds, WhatMakesTwoMappingsOneObject) {
     EXPECT_EQ(id("3000-4000 r-xp 00000000 00:00 0 [vdso]"), vdso);
     const uint32_t anonAgain = id("1000-2000 rw-p 00000000 00:00 0 ");
     const uint32_t heap = id("1000-2000 rw-p 00000000 00:00 0 [heap]");
-    std::vector<uint32_t> distinct = {libcText, libcData, otherDevice, shared, vdso, vvar, anon, anonAgain, heap};
+    // A SysV segment shows its id where other shmem shows an inode number:
+    // segment 1025 is not the shared mapping above.
+    const uint32_t segment = id("1000-2000 rw-s 00000000 00:01 1025 /SYSV00000000 (deleted)");
+    EXPECT_EQ(id("4000-5000 rw-s 00000000 00:01 1025 /SYSV00000000 (deleted)"), segment);
+    std::vector<uint32_t> distinct = {libcText, libcData, otherDevice, shared, vdso, vvar, anon, anonAgain, heap, segment};
     std::sort(distinct.begin(), distinct.end());
-    EXPECT_EQ(distinct, (std::vector<uint32_t>{1, 2, 3, 4, 5, 6, 7, 8, 9})) << "distinct, dense, never 0";
+    EXPECT_EQ(distinct, (std::vector<uint32_t>{1, 2, 3, 4, 5, 6, 7, 8, 9, 10})) << "distinct, dense, never 0";
     EXPECT_EQ(ids.idForFrameSet(3, 0x1000), ids.idForFrameSet(3, 0x1000));
     EXPECT_NE(ids.idForFrameSet(3, 0x1000), ids.idForFrameSet(4, 0x1000));
     EXPECT_NE(ids.idForFrameSet(3, 0x1000), ids.idForFrameSet(3, 0x2000));

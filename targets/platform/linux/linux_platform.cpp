@@ -895,7 +895,7 @@ void VSLinuxPlatform::_buildParts(Task &task) {
             }
         } else if (resolved && _isSharedWindow(region, kind)) {
             const uint64_t first = region.offset / _pageSize;
-            const uint64_t device = vs::deviceNumber(region.devMajor, region.devMinor);
+            const uint64_t device = vs::objectDevice(region);
             objectPages = _sharedPages.objectPages(device, region.inode, first, region.size() / _pageSize);
         }
         task.firstPart.push_back(static_cast<uint32_t>(task.parts.size()));
@@ -1087,7 +1087,7 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
         // A shared mapping: which file pages it holds, and which of them are
         // dirty (shmem pages are all dirty; page cache says per frame).
         vs::SharedPageIndex::Window pages;
-        pages.device = vs::deviceNumber(region.devMajor, region.devMinor);
+        pages.device = vs::objectDevice(region);
         pages.inode = region.inode;
         pages.firstPage = region.offset / _pageSize;
         pages.pageCount = region.size() / _pageSize;

@@ -168,7 +168,7 @@ std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind 
                                          const std::vector<SharedAnonymousPart> &shared,
                                          const std::optional<ObjectPages> &objectPages) {
     const VSRegionInfo common = commonRecord(region, userTag);
-    const uint64_t device = deviceNumber(region.devMajor, region.devMinor);
+    const uint64_t device = objectDevice(region);
     const auto pages = [pageSize](uint64_t bytes) { return bytes / pageSize; };
     std::vector<VSRegionInfo> parts;
 

@@ -95,6 +95,16 @@ inline uint64_t deviceNumber(uint32_t majorNumber, uint32_t minorNumber) {
     return (uint64_t{majorNumber} << 32) | minorNumber;
 }
 
+// The device under which the layer keys a mapping's object. SysV segments
+// live on the shmem device like memfds and shared anonymous memory, but show
+// their segment id where those show an inode number: a numbering of its own,
+// kept apart so that segment 29 never meets the memfd with inode 29.
+inline constexpr uint64_t kSysVSegmentDevice = 1ull << 63;
+inline uint64_t objectDevice(const SmapsRegion &region) {
+    const uint64_t device = deviceNumber(region.devMajor, region.devMinor);
+    return region.path.starts_with("/SYSV") && region.inode != 0 ? device | kSysVSegmentDevice : device;
+}
+
 // Parsed regions kept small while they wait (a run holds every target's
 // parse until the pages they share are known): variable-length numbers,
 // each distinct path once. unpackSmapsRegions gives back exactly what was
