@@ -6,10 +6,19 @@
 
 #include <gtest/gtest.h>
 
+#include <map>
 #include <string>
 #include <vector>
 
 namespace {
+
+std::vector<vs::KeyRun> runsOf(const std::vector<uint64_t> &keys) {
+    std::vector<vs::KeyRun> runs;
+    for (const uint64_t key : keys) {
+        vs::appendKey(runs, key);
+    }
+    return runs;
+}
 
 TEST(SharedPageIndex, EachPageBelongsToTheExactSetOfTargetsMappingIt) {
     struct Case {
@@ -33,34 +42,64 @@ TEST(SharedPageIndex, EachPageBelongsToTheExactSetOfTargetsMappingIt) {
         SCOPED_TRACE(c.what);
         vs::SharedPageIndex index;
         for (const auto &[pid, keys] : c.adds) {
-            index.addPages(pid, keys);
+            index.addPages(pid, runsOf(keys));
         }
         const std::optional<uint32_t> set = index.sharedSet(c.key);
         EXPECT_EQ(set.has_value(), !c.members.empty());
         if (set) {
             EXPECT_EQ(index.setMembers(*set), c.members);
         }
-        std::vector<uint32_t> sets;
-        index.sharedSets(std::vector<uint64_t>{c.key}, sets);
-        EXPECT_EQ(sets.at(0), set.value_or(vs::SharedPageIndex::kNoSet)) << "one lookup or many, the same answer";
+        index.freeze();
+        EXPECT_EQ(index.sharedSet(c.key), set) << "the same answer once the index is frozen";
     }
 }
 
-TEST(SharedPageIndex, ManyPagesKeepTheirSetsAsTheIndexGrows) {
+TEST(SharedPageIndex, RunsAreCountedBySetAsTheIndexGrows) {
+    // A parent's frames in runs of every length, across blocks and shards;
+    // a child maps every other run, a grandchild part of one.
     vs::SharedPageIndex index;
-    std::vector<uint64_t> parent, child;
-    for (uint64_t frame = 1; frame <= 100000; ++frame) {
-        parent.push_back(frame * 3);
-        if (frame % 2 == 0) {
-            child.push_back(frame * 3);
+    std::vector<vs::KeyRun> parent, child;
+    uint64_t next = 1000, childPages = 0;
+    for (uint64_t length = 1; length <= 700; ++length) {
+        parent.push_back({next, length});
+        if (length % 2 == 0) {
+            child.push_back({next, length});
+            childPages += length;
         }
+        next += length + 3;
     }
+    parent.push_back({vs::kSwapKey | 77, 5});
+    child.push_back({vs::kSwapKey | 79, 5}); // three of the parent's slots, two of its own
     index.addPages(1, parent);
     index.addPages(2, child);
-    std::vector<uint32_t> sets;
-    index.sharedSets(parent, sets);
-    for (size_t i = 0; i < parent.size(); ++i) {
-        ASSERT_EQ(sets[i] != vs::SharedPageIndex::kNoSet, i % 2 == 1) << parent[i];
+    index.addPages(3, std::vector<vs::KeyRun>{{child[10].first + 2, 7}});
+    for (const bool frozen : {false, true}) {
+        SCOPED_TRACE(frozen ? "frozen" : "still adding");
+        if (frozen) {
+            index.freeze();
+        }
+        std::vector<vs::SharedPageIndex::SetPages> sets;
+        index.sharedPages(parent, sets);
+        std::map<std::vector<int32_t>, std::pair<uint64_t, uint64_t>> byMembers;
+        for (const auto &set : sets) {
+            byMembers[index.setMembers(set.set)] = {set.presentPages, set.swappedPages};
+        }
+        using Pages = std::pair<uint64_t, uint64_t>;
+        EXPECT_EQ(byMembers, (std::map<std::vector<int32_t>, Pages>{{{1, 2}, {childPages - 7, 3}},
+                                                                    {{1, 2, 3}, {7, 0}}}));
+        // Page by page, wherever its run began, the same sets.
+        std::map<std::vector<int32_t>, std::pair<uint64_t, uint64_t>> byPage;
+        for (const vs::KeyRun &run : parent) {
+            for (uint64_t key = run.first; key < run.first + run.length; ++key) {
+                if (const auto set = index.sharedSet(key)) {
+                    auto &pages = byPage[index.setMembers(*set)];
+                    ((key & vs::kSwapKey) != 0 ? pages.second : pages.first) += 1;
+                }
+            }
+        }
+        EXPECT_EQ(byPage, byMembers);
+        index.sharedPages(std::vector<vs::KeyRun>{{next + 10, 4096}}, sets);
+        EXPECT_TRUE(sets.empty()) << "pages nobody added";
     }
 }
 
@@ -109,7 +148,7 @@ TEST(SharedPageIndex, AnObjectHoldsTheUnionOfItsMappingsPages) {
     }
 }
 
-TEST(SharedPageIndex, KeyRunsGiveBackEveryKeyInOrder) {
+TEST(SharedPageIndex, KeyRunsComeBackAsTheyWent) {
     const std::vector<std::vector<uint64_t>> cases = {
         {},
         {7},
@@ -118,17 +157,19 @@ TEST(SharedPageIndex, KeyRunsGiveBackEveryKeyInOrder) {
         {UINT64_MAX, 0, UINT64_MAX},
     };
     for (const auto &keys : cases) {
+        const std::vector<vs::KeyRun> runs = runsOf(keys);
         std::vector<uint8_t> bytes;
-        vs::encodeKeyRuns(keys, bytes);
-        std::vector<uint64_t> back;
+        vs::encodeKeyRuns(runs, bytes);
+        std::vector<vs::KeyRun> back;
         vs::decodeKeyRuns(bytes, back);
-        EXPECT_EQ(back, keys);
+        EXPECT_EQ(back, runs);
     }
     // Consecutive frames are what make it small.
     std::vector<uint64_t> run(65536);
     for (size_t i = 0; i < run.size(); ++i) run[i] = 0x123456 + i;
+    EXPECT_EQ(runsOf(run), (std::vector<vs::KeyRun>{{0x123456, 65536}}));
     std::vector<uint8_t> bytes;
-    vs::encodeKeyRuns(run, bytes);
+    vs::encodeKeyRuns(runsOf(run), bytes);
     EXPECT_LT(bytes.size(), 16u);
 }
 

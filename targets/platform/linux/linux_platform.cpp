@@ -847,8 +847,8 @@ void VSLinuxPlatform::_buildParts(Task &task) {
     UniqueFd pagemap;
     bool pagemapFailed = false;
     std::vector<vs::SharedAnonymousPart> shared;
-    thread_local std::vector<uint64_t> keys;
-    thread_local std::vector<uint32_t> sets;
+    thread_local std::vector<vs::KeyRun> runs;
+    thread_local std::vector<vs::SharedPageIndex::SetPages> sets;
     for (uint32_t i = 0; i < task.regions.size(); ++i) {
         const SmapsRegion &region = task.regions[i];
         const vs::MappingKind kind = task.kinds[i];
@@ -857,41 +857,26 @@ void VSLinuxPlatform::_buildParts(Task &task) {
         if (resolved && vs::mayShareAnonymousPages(region, kind) && !pagemapFailed) {
             // The frames as first seen (or a second look at them): the index
             // knows which sets they are in now that every target was seen.
-            keys.clear();
+            runs.clear();
             const auto stored = std::find_if(task.storedKeys.begin(), task.storedKeys.end(), [&](const auto &s) {
                 return s.start == region.start && s.end == region.end;
             });
             if (stored != task.storedKeys.end()) {
                 vs::decodeKeyRuns(std::span<const uint8_t>(task.storedBytes.data() + stored->begin, stored->length),
-                                  keys);
+                                  runs);
             } else {
                 if (!pagemap.valid()) {
                     pagemap = UniqueFd(::openat(task.dir.get(), "pagemap", O_RDONLY | O_CLOEXEC));
                     pagemapFailed = !pagemap.valid();
                 }
                 if (pagemap.valid()) {
-                    _candidateKeys(pagemap.get(), region, keys, nullptr);
+                    _candidateKeys(pagemap.get(), region, runs, nullptr);
                 }
             }
-            _sharedPages.sharedSets(keys, sets);
-            // Counted by set first; a region meets few sets.
-            std::vector<std::pair<uint32_t, vs::SharedAnonymousPart>> bySet;
-            for (size_t k = 0; k < keys.size(); ++k) {
-                if (sets[k] == vs::SharedPageIndex::kNoSet) {
-                    continue; // no other target maps it: the mapping's own
-                }
-                auto set = bySet.begin();
-                while (set != bySet.end() && set->first != sets[k]) {
-                    ++set;
-                }
-                if (set == bySet.end()) {
-                    set = bySet.insert(bySet.end(), {sets[k], vs::SharedAnonymousPart{}});
-                }
-                ((keys[k] & vs::kSwapKey) != 0 ? set->second.swappedPages : set->second.presentPages) += 1;
-            }
-            for (auto &[set, part] : bySet) {
-                part.objectId = ids.idForFrameSet(set, region.start);
-                shared.push_back(part);
+            // Pages no other target maps stay the mapping's own.
+            _sharedPages.sharedPages(runs, sets);
+            for (const vs::SharedPageIndex::SetPages &set : sets) {
+                shared.push_back({ids.idForFrameSet(set.set, region.start), set.presentPages, set.swappedPages});
             }
         } else if (resolved && _isSharedWindow(region, kind)) {
             const uint64_t first = region.offset / _pageSize;
@@ -917,7 +902,7 @@ bool VSLinuxPlatform::_isSharedWindow(const SmapsRegion &region, vs::MappingKind
            (kind == vs::MappingKind::File || kind == vs::MappingKind::SharedMemory);
 }
 
-void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, std::vector<uint64_t> &keys,
+void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, std::vector<vs::KeyRun> &runs,
                                      bool *framesUnreadable) {
     _readPagemap(pagemapFd, region.start, region.size() / _pageSize, (region.rss + region.swap) / _pageSize,
                  [&](std::span<const uint64_t> entries, uint64_t) {
@@ -942,7 +927,7 @@ void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, s
                              }
                              continue;
                          }
-                         keys.push_back(key);
+                         vs::appendKey(runs, key);
                      }
                      return true;
                  });
@@ -1053,7 +1038,7 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
         return task->prepared;
     }
     UniqueFd pagemap;
-    thread_local std::vector<uint64_t> keys;
+    thread_local std::vector<vs::KeyRun> runs;
     std::vector<std::pair<uint64_t, uint64_t>> frames; // frame, page of the mapping
     bool framesUnreadable = false;
     bool any = false;
@@ -1076,11 +1061,11 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
             }
         }
         if (anonymous) {
-            keys.clear();
-            _candidateKeys(pagemap.get(), region, keys, &framesUnreadable);
-            _sharedPages.addPages(task->pid, keys);
+            runs.clear();
+            _candidateKeys(pagemap.get(), region, runs, &framesUnreadable);
+            _sharedPages.addPages(task->pid, runs);
             const size_t before = task->storedBytes.size();
-            vs::encodeKeyRuns(keys, task->storedBytes);
+            vs::encodeKeyRuns(runs, task->storedBytes);
             task->storedKeys.push_back({region.start, region.end, before, task->storedBytes.size() - before});
             continue;
         }

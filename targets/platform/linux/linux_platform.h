@@ -120,8 +120,8 @@ private:
     void _buildParts(Task &task);
     bool _isSharedWindow(const vs::SmapsRegion &region, vs::MappingKind kind) const;
     // The keys (frame, or swap entry) of a private mapping's anonymous
-    // pages that other processes may map too.
-    void _candidateKeys(int pagemapFd, const vs::SmapsRegion &region, std::vector<uint64_t> &keys,
+    // pages that other processes may map too, appended as runs.
+    void _candidateKeys(int pagemapFd, const vs::SmapsRegion &region, std::vector<vs::KeyRun> &runs,
                         bool *framesUnreadable);
     // Reads pagemap entries of `pages` pages from `address` in large
     // batches; `batch` gets each with the index of its first page and

@@ -46,31 +46,26 @@ size_t slotOf(uint64_t key, size_t mask) {
 
 } // namespace
 
-void encodeKeyRuns(std::span<const uint64_t> keys, std::vector<uint8_t> &out) {
+void encodeKeyRuns(std::span<const KeyRun> runs, std::vector<uint8_t> &out) {
     uint64_t next = 0; // the key after the last run
-    for (size_t i = 0; i < keys.size();) {
-        size_t length = 1;
-        while (i + length < keys.size() && keys[i + length] == keys[i] + length) {
-            ++length;
-        }
+    for (const KeyRun &run : runs) {
         // The distance either way, its sign in the lowest bit.
-        const uint64_t distance = keys[i] - next;
+        const uint64_t distance = run.first - next;
         vs::putPackedNumber(out, (distance << 1) ^ static_cast<uint64_t>(static_cast<int64_t>(distance) >> 63));
-        vs::putPackedNumber(out, length);
-        next = keys[i] + length;
-        i += length;
+        vs::putPackedNumber(out, run.length);
+        next = run.first + run.length;
     }
 }
 
-void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<uint64_t> &keys) {
+void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<KeyRun> &runs) {
     uint64_t next = 0;
     for (size_t at = 0; at < bytes.size();) {
         const uint64_t coded = vs::takePackedNumber(bytes, at);
         const uint64_t distance = (coded >> 1) ^ (0 - (coded & 1));
         const uint64_t length = vs::takePackedNumber(bytes, at);
         const uint64_t first = next + distance;
-        for (uint64_t k = 0; k < length; ++k) {
-            keys.push_back(first + k);
+        if (length != 0) {
+            runs.push_back({first, length});
         }
         next = first + length;
     }
@@ -155,15 +150,62 @@ uint32_t SharedPageIndex::_setWith(uint32_t set, int32_t pid) {
     return result;
 }
 
-void SharedPageIndex::addPages(int32_t pid, std::span<const uint64_t> keys) {
-    thread_local std::array<std::vector<uint64_t>, kShards> byShard;
-    for (auto &bucket : byShard) {
-        bucket.clear();
+template <typename Piece>
+void SharedPageIndex::_forEachPiece(const KeyRun &run, Piece &&piece) {
+    uint64_t key = run.first;
+    uint64_t left = run.length;
+    while (left > 0) {
+        // Keys to the end of the chunk (unsigned arithmetic also gets the
+        // last chunk of the key space right).
+        const uint64_t room = (((key >> kChunkShift) + 1) << kChunkShift) - key;
+        const uint64_t count = std::min(left, room);
+        piece(_shardOf(key), key, count);
+        key += count;
+        left -= count;
     }
-    for (const uint64_t key : keys) {
-        if (key != 0) {
-            byShard[_shardOf(key)].push_back(key);
+}
+
+template <typename Each>
+void SharedPageIndex::_setsOf(size_t shard, uint64_t first, uint64_t length, Each &&each) const {
+    const PageTable &table = _shards[shard].pages;
+    uint32_t stretchSet = 0;
+    uint64_t stretch = 0;
+    for (uint64_t key = first, left = length; left > 0;) {
+        const uint32_t *lanes = table.find(key >> kBlockShift);
+        const uint64_t lane = key & (PageTable::kLanes - 1);
+        const uint64_t count = std::min<uint64_t>(left, PageTable::kLanes - lane);
+        for (uint64_t k = lane; k < lane + count; ++k) {
+            const uint32_t set = lanes == nullptr ? 0 : lanes[k];
+            if (set != stretchSet && stretch > 0) {
+                each(stretchSet, stretch);
+                stretch = 0;
+            }
+            stretchSet = set;
+            ++stretch;
         }
+        key += count;
+        left -= count;
+    }
+    if (stretch > 0) {
+        each(stretchSet, stretch);
+    }
+}
+
+void SharedPageIndex::addPages(int32_t pid, std::span<const KeyRun> runs) {
+    // (first key, length) of the pieces of the runs, by shard.
+    thread_local std::array<std::vector<std::pair<uint64_t, uint64_t>>, kShards> byShard;
+    for (auto &pieces : byShard) {
+        pieces.clear();
+    }
+    for (KeyRun run : runs) {
+        if (run.first == 0 && run.length > 0) {
+            // Key 0 is a hidden frame number: nobody's page.
+            run.first = 1;
+            run.length -= 1;
+        }
+        _forEachPiece(run, [&](size_t shard, uint64_t first, uint64_t length) {
+            byShard[shard].emplace_back(first, length);
+        });
     }
     // A target takes each set it meets to one other set (itself added):
     // those steps are remembered here, away from the shared table.
@@ -184,64 +226,67 @@ void SharedPageIndex::addPages(int32_t pid, std::span<const uint64_t> keys) {
             continue;
         }
         std::lock_guard<std::mutex> lock(_shards[shard].mutex);
-        // Neighbouring pages are mostly in the same block and set: the last
-        // of each first.
+        // Neighbouring pages are mostly in the same set: the last step first.
         uint32_t lastFrom = UINT32_MAX, lastTo = 0;
-        uint64_t lastBlock = UINT64_MAX;
-        uint32_t *lanes = nullptr;
-        for (const uint64_t key : byShard[shard]) {
-            if ((key >> kBlockShift) != lastBlock) {
-                lastBlock = key >> kBlockShift;
-                lanes = _shards[shard].pages.findOrAdd(lastBlock);
+        for (const auto &[first, length] : byShard[shard]) {
+            for (uint64_t key = first, left = length; left > 0;) {
+                uint32_t *lanes = _shards[shard].pages.findOrAdd(key >> kBlockShift);
+                const uint64_t lane = key & (PageTable::kLanes - 1);
+                const uint64_t count = std::min<uint64_t>(left, PageTable::kLanes - lane);
+                for (uint64_t k = lane; k < lane + count; ++k) {
+                    if (lanes[k] != lastFrom) {
+                        lastFrom = lanes[k];
+                        lastTo = step(lastFrom);
+                    }
+                    lanes[k] = lastTo;
+                }
+                key += count;
+                left -= count;
             }
-            uint32_t &set = lanes[key & (PageTable::kLanes - 1)];
-            if (set != lastFrom) {
-                lastFrom = set;
-                lastTo = step(set);
-            }
-            set = lastTo;
         }
     }
 }
 
 std::optional<uint32_t> SharedPageIndex::sharedSet(uint64_t key) const {
-    std::vector<uint32_t> sets;
-    sharedSets(std::span<const uint64_t>(&key, 1), sets);
-    return sets[0] == kNoSet ? std::nullopt : std::optional<uint32_t>(sets[0]);
+    std::vector<SetPages> sets;
+    const KeyRun run{key, 1};
+    sharedPages(std::span<const KeyRun>(&run, 1), sets);
+    return sets.empty() ? std::nullopt : std::optional<uint32_t>(sets[0].set);
 }
 
-void SharedPageIndex::sharedSets(std::span<const uint64_t> keys, std::vector<uint32_t> &sets) const {
-    sets.assign(keys.size(), kNoSet);
+void SharedPageIndex::sharedPages(std::span<const KeyRun> runs, std::vector<SetPages> &out) const {
+    out.clear();
     const bool frozen = _frozen.load();
-    uint64_t lastBlock = UINT64_MAX;
-    const uint32_t *lanes = nullptr;
-    for (size_t i = 0; i < keys.size(); ++i) {
-        Shard &shard = _shards[_shardOf(keys[i])];
-        uint32_t set = 0;
-        if (frozen) {
-            if ((keys[i] >> kBlockShift) != lastBlock) {
-                lastBlock = keys[i] >> kBlockShift;
-                lanes = shard.pages.find(lastBlock);
+    for (const KeyRun &run : runs) {
+        const bool swapped = (run.first & kSwapKey) != 0;
+        // A region meets few sets: a short list beats a map.
+        auto add = [&](uint32_t set, uint64_t count) {
+            auto entry = out.begin();
+            while (entry != out.end() && entry->set != set) {
+                ++entry;
             }
-            set = lanes == nullptr ? 0 : lanes[keys[i] & (PageTable::kLanes - 1)];
-            if (_sets[set].size() >= 2) {
-                sets[i] = set;
+            if (entry == out.end()) {
+                entry = out.insert(out.end(), SetPages{set, 0, 0});
             }
-            continue;
-        }
-        // While pages are still added: the shard's lock, then the sets'
-        // lock, one after the other, never both (adding takes them nested
-        // the other way round).
-        {
-            std::lock_guard<std::mutex> lock(shard.mutex);
-            const uint32_t *found = shard.pages.find(keys[i] >> kBlockShift);
-            set = found == nullptr ? 0 : found[keys[i] & (PageTable::kLanes - 1)];
-        }
-        std::lock_guard<std::mutex> lock(_mutex);
-        if (_sets[set].size() >= 2) {
-            sets[i] = set;
-        }
+            (swapped ? entry->swappedPages : entry->presentPages) += count;
+        };
+        _forEachPiece(run, [&](size_t shard, uint64_t first, uint64_t length) {
+            if (frozen) {
+                _setsOf(shard, first, length, add);
+                return;
+            }
+            // While pages are still added: the shard's lock here, the sets'
+            // lock below, never both (adding takes them nested the other
+            // way round).
+            std::lock_guard<std::mutex> lock(_shards[shard].mutex);
+            _setsOf(shard, first, length, add);
+        });
     }
+    std::unique_lock<std::mutex> lock(_mutex, std::defer_lock);
+    if (!frozen) {
+        lock.lock();
+    }
+    std::erase_if(out, [&](const SetPages &entry) { return _sets[entry.set].size() < 2; });
 }
 
 std::vector<int32_t> SharedPageIndex::setMembers(uint32_t set) const {

@@ -29,13 +29,29 @@ namespace vs {
 // they never meet a frame number (frame numbers have at most 55 bits).
 inline constexpr uint64_t kSwapKey = 1ull << 63;
 
+// Keys of consecutive pages mostly follow each other (neighbouring frames,
+// neighbouring swap slots): they travel as runs, and the index works a run
+// at a time.
+struct KeyRun {
+    uint64_t first = 0;
+    uint64_t length = 0;
+    bool operator==(const KeyRun &) const = default;
+};
+// Appends `key` to `runs`, extending the last run when it follows it.
+inline void appendKey(std::vector<KeyRun> &runs, uint64_t key) {
+    if (!runs.empty() && runs.back().first + runs.back().length == key) {
+        runs.back().length += 1;
+    } else {
+        runs.push_back({key, 1});
+    }
+}
+
 // A process's page keys kept between its first look and its walk, small:
-// a page's frame mostly follows the previous page's, so runs of
-// consecutive keys are stored as (distance from the last run, length),
-// each a variable-length number.
-void encodeKeyRuns(std::span<const uint64_t> keys, std::vector<uint8_t> &out);
-// Appends the keys of `bytes` (as encodeKeyRuns wrote them) to `keys`.
-void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<uint64_t> &keys);
+// each run as (distance from the end of the last run, length), each a
+// variable-length number.
+void encodeKeyRuns(std::span<const KeyRun> runs, std::vector<uint8_t> &out);
+// Appends the runs of `bytes` (as encodeKeyRuns wrote them) to `runs`.
+void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<KeyRun> &runs);
 
 // The whole object's pages within a shared mapping's range, where several
 // mappings of the object hold different pages (the union of what they
@@ -49,15 +65,19 @@ class SharedPageIndex {
 public:
     // The pages of a target that other targets may map too (keys as
     // above). A target may add in several calls.
-    void addPages(int32_t pid, std::span<const uint64_t> keys);
+    void addPages(int32_t pid, std::span<const KeyRun> runs);
 
     // The set of targets mapping the page when it has more than one
     // member; nullopt for a page one target alone maps.
     std::optional<uint32_t> sharedSet(uint64_t key) const;
-    // The same for many keys under one lock: `sets` gets, per key, its set
-    // or kNoSet.
-    static constexpr uint32_t kNoSet = UINT32_MAX;
-    void sharedSets(std::span<const uint64_t> keys, std::vector<uint32_t> &sets) const;
+    // How many of the pages of `runs` lie in each set of more than one
+    // target, swapped pages apart; pages of one target alone are left out.
+    struct SetPages {
+        uint32_t set = 0;
+        uint64_t presentPages = 0;
+        uint64_t swappedPages = 0;
+    };
+    void sharedPages(std::span<const KeyRun> runs, std::vector<SetPages> &out) const;
     // The pids of a set, sorted.
     std::vector<int32_t> setMembers(uint32_t set) const;
 
@@ -103,6 +123,14 @@ private:
     // addressing over block numbers, at most 70% full. A key never seen
     // reads as set 0, the empty set.
     static constexpr unsigned kBlockShift = 3;
+    // Calls `piece(shard, first, length)` for the parts of a run that lie in
+    // one shard each.
+    template <typename Piece>
+    static void _forEachPiece(const KeyRun &run, Piece &&piece);
+    // The set of every page of [first, first + length) in `shard`, to
+    // `each(set, count)` by stretches of pages in the same set.
+    template <typename Each>
+    void _setsOf(size_t shard, uint64_t first, uint64_t length, Each &&each) const;
     class PageTable {
     public:
         static constexpr size_t kLanes = size_t{1} << kBlockShift;
@@ -120,14 +148,16 @@ private:
     };
 
     // Pages are spread over shards, each with its own lock, so that
-    // targets add their pages side by side.
+    // targets add their pages side by side; 512 neighbouring keys (2 MiB of
+    // frames) share a shard, so a run seldom needs more than one.
     static constexpr size_t kShards = 16;
+    static constexpr unsigned kChunkShift = 9;
     struct Shard {
         std::mutex mutex;
         PageTable pages;
     };
     static size_t _shardOf(uint64_t key) {
-        return static_cast<size_t>(((key >> kBlockShift) * 0x9E3779B97F4A7C15ull) >> 60);
+        return static_cast<size_t>(((key >> kChunkShift) * 0x9E3779B97F4A7C15ull) >> 60);
     }
 
     mutable std::mutex _mutex; // the sets and the objects
