@@ -4,8 +4,10 @@
 // last item it prints "ready" and waits until standard input reaches end of
 // file, then undoes nothing and exits 0.
 //
-//   anon:LABEL:PAGES:TOUCHED     private anonymous memory, first TOUCHED
-//                                pages written
+//   anon:LABEL:PAGES:TOUCHED[:READ]
+//                                private anonymous memory, first TOUCHED
+//                                pages written, the READ pages after them
+//                                only read (the kernel's shared zero page)
 //   file:LABEL:PATH              PATH mapped read-only and private, every
 //                                page read
 //   shared:LABEL:PAGES[:TOUCHED] shared anonymous memory, every page (or the
@@ -223,10 +225,18 @@ int main(int argc, char **argv) {
         const std::vector<std::string> item = split(argv[i]);
         const std::string &kind = item[0];
         const std::string label = item.size() > 1 ? item[1] : kind;
-        if (kind == "anon" && item.size() == 4) {
+        if (kind == "anon" && (item.size() == 4 || item.size() == 5)) {
             const size_t pages = number(item[2]);
             char *start = fencedAnonymous(pages, PROT_READ | PROT_WRITE);
             touch(start, number(item[3]));
+            const size_t read = item.size() == 5 ? std::min(number(item[4]), pages - std::min(pages, number(item[3]))) : 0;
+            unsigned sum = 0;
+            for (size_t p = number(item[3]); p < number(item[3]) + read; ++p) {
+                sum += static_cast<unsigned char>(static_cast<volatile char *>(start)[p * kPage]);
+            }
+            if (sum != 0) {
+                fail("fresh anonymous memory read as nonzero");
+            }
             remember(label, start, pages);
             printRegion(label, start, pages);
         } else if (kind == "pfile" && item.size() == 4) {

@@ -18,6 +18,7 @@
 #include <fcntl.h>
 #include <malloc.h>
 #include <sys/ioctl.h>
+#include <sys/mman.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
@@ -904,6 +905,7 @@ bool VSLinuxPlatform::_isSharedWindow(const SmapsRegion &region, vs::MappingKind
 
 void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, std::vector<vs::KeyRun> &runs,
                                      bool *framesUnreadable) {
+    const uint64_t zeroPage = _zeroFrame();
     _readPagemap(pagemapFd, region.start, region.size() / _pageSize, (region.rss + region.swap) / _pageSize,
                  [&](std::span<const uint64_t> entries, uint64_t) {
                      for (const uint64_t entry : entries) {
@@ -915,6 +917,11 @@ void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, s
                                  continue;
                              }
                              key = entry & kPagemapPfnMask;
+                             // Read but never written: the kernel's zero
+                             // page, in no process's resident memory.
+                             if (key == zeroPage && key != 0) {
+                                 continue;
+                             }
                          } else if ((entry & kPagemapSwapped) != 0 && (entry & kPagemapGuard) == 0) {
                              key = (entry & kPagemapPfnMask) == 0 ? 0 : (vs::kSwapKey | (entry & kPagemapPfnMask));
                          } else {
@@ -1025,6 +1032,36 @@ bool VSLinuxPlatform::_readPagemap(int pagemapFd, uint64_t address, uint64_t pag
         at = scan.walkEnd;
     }
     return true;
+}
+
+uint64_t VSLinuxPlatform::_zeroFrame() {
+    // Learnt from this program's own memory: a page read before it is
+    // written maps the zero page, and the kernel's page flags confirm it.
+    // (pagemap shows the huge zero page as a file page, left out anyway.)
+    std::call_once(_zeroFrameOnce, [this] {
+        constexpr uint64_t kPageFlagZeroPage = 1ull << 24; // KPF_ZERO_PAGE
+        UniqueFd pagemap(::open("/proc/self/pagemap", O_RDONLY | O_CLOEXEC));
+        UniqueFd flags(::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC));
+        if (!pagemap.valid() || !flags.valid()) {
+            return; // frames cannot be read either
+        }
+        void *page = ::mmap(nullptr, _pageSize, PROT_READ, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+        if (page == MAP_FAILED) {
+            return;
+        }
+        (void)*static_cast<const volatile char *>(page);
+        uint64_t entry = 0, pageFlags = 0;
+        const auto at = static_cast<off_t>(reinterpret_cast<uintptr_t>(page) / _pageSize * sizeof entry);
+        const bool present = ::pread(pagemap.get(), &entry, sizeof entry, at) == sizeof entry &&
+                             (entry & kPagemapPresent) != 0 && (entry & kPagemapPfnMask) != 0;
+        ::munmap(page, _pageSize);
+        const uint64_t frame = entry & kPagemapPfnMask;
+        if (present && ::pread(flags.get(), &pageFlags, sizeof pageFlags, static_cast<off_t>(frame * sizeof pageFlags)) ==
+                           sizeof pageFlags && (pageFlags & kPageFlagZeroPage) != 0) {
+            _zeroPage = frame;
+        }
+    });
+    return _zeroPage;
 }
 
 bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {

@@ -174,6 +174,12 @@ private:
     std::once_flag _kpageflagsOnce;
     int _kpageflagsFd = -1;
 
+    // The kernel's zero page: every process that reads anonymous memory it
+    // never wrote maps it, and it is nobody's memory. 0 when unknown.
+    uint64_t _zeroFrame();
+    std::once_flag _zeroFrameOnce;
+    uint64_t _zeroPage = 0;
+
     std::once_flag _swapOnce;
     bool _swapConfigured = false;
 
