@@ -102,6 +102,8 @@ TEST(LiveRun, ForkFamiliesCountEachPageOnce) {
         {"pages only read are the kernel's zero page, nobody's memory",
          {"anon:a:" + n + ":" + std::to_string(pages / 2) + ":" + std::to_string(pages / 2), "fork:c1", "fork:c2"},
          untagged, 4 * MiB, 0},
+        {"a child that moved its copy elsewhere still shares it",
+         {"anon:a:" + n + ":" + n, "fork:c1:a:move", "fork:c2"}, untagged, 8 * MiB, 0},
         {"a shared region written in quarters",
          {"shared:s:" + n + ":0", writes("fork:c1:s", 0, quarter), writes("fork:c2:s", quarter, quarter),
           writes("fork:c3:s", 2 * quarter, quarter), writes("fork:c4:s", 3 * quarter, quarter)},

@@ -42,6 +42,9 @@
 //                                pid
 //   fork:LABEL:ITEM:FIRST:COUNT  the same, but the grandchild writes only
 //                                pages FIRST to FIRST+COUNT of item ITEM
+//   fork:LABEL:ITEM:move         the same, but the grandchild writes nothing
+//                                and moves item ITEM to another address
+//                                (mremap, as realloc does with large blocks)
 //
 // Every anonymous item is placed between two inaccessible pages so that the
 // kernel cannot merge it with a neighbour of the same protection.
@@ -407,16 +410,22 @@ int main(int argc, char **argv) {
         } else if (kind == "libc" && item.size() == 2) {
             std::string copy = label;
             dl_iterate_phdr(printLoads, &copy);
-        } else if (kind == "fork" && (item.size() == 2 || item.size() == 5)) {
+        } else if (kind == "fork" && (item.size() == 2 || item.size() == 5 || (item.size() == 4 && item[3] == "move"))) {
             SharedItem written{nullptr, 0};
-            if (item.size() == 5) {
+            SharedItem moved{nullptr, 0};
+            if (item.size() > 2) {
                 const auto found = std::find_if(gItems.begin(), gItems.end(),
                                                 [&](const auto &entry) { return entry.first == item[2]; });
-                if (found == gItems.end() || number(item[3]) + number(item[4]) > found->second.pages) {
+                if (found == gItems.end() ||
+                    (item.size() == 5 && number(item[3]) + number(item[4]) > found->second.pages)) {
                     std::fprintf(stderr, "vs_memchild: no such pages '%s'\n", argv[i]);
                     return 2;
                 }
-                written = {found->second.start + number(item[3]) * kPage, number(item[4])};
+                if (item.size() == 5) {
+                    written = {found->second.start + number(item[3]) * kPage, number(item[4])};
+                } else {
+                    moved = found->second;
+                }
             }
             std::fflush(stdout);
             int done[2];
@@ -428,7 +437,13 @@ int main(int argc, char **argv) {
                 fail("fork");
             }
             if (pid == 0) {
-                if (written.start != nullptr) {
+                if (moved.start != nullptr) {
+                    char *to = fencedAnonymous(moved.pages, PROT_READ | PROT_WRITE);
+                    if (mremap(moved.start, moved.pages * kPage, moved.pages * kPage, MREMAP_MAYMOVE | MREMAP_FIXED,
+                               to) == MAP_FAILED) {
+                        fail("mremap");
+                    }
+                } else if (written.start != nullptr) {
                     touch(written.start, written.pages);
                 } else {
                     for (const SharedItem &shared : gSharedItems) {

@@ -154,14 +154,14 @@ TEST(LinuxRegionRecords, PartsOfOneMappingEachInOneObject) {
          "1000-5000 rw-p 0 00:01 12 /dev/shm/pool\nRss: 8 kB\nAnonymous: 4 kB\nShared_Clean: 4 kB\n"
          "Private_Dirty: 4 kB\nVmFlags: rd wr\n",
          {}, {}, {{"file 0:1 inode 12 offset 0", 0, 1, 0, 0, 0, kShared, 0}, {"own", 0, 1, 1, 0, 0, kPrivate, 0}}},
-        {"anonymous pages shared after fork go to the set, at the mapping's address",
+        {"anonymous pages shared after fork go to the set, where the layer placed them",
          "1000-9000 rw-p 0 00:00 0 \nRss: 24 kB\nAnonymous: 24 kB\nShared_Dirty: 20 kB\nPrivate_Dirty: 4 kB\n"
          "Swap: 8 kB\nSwapPss: 4 kB\nVmFlags: rd wr\n",
-         {{kSetObject, 5, 1}}, {},
-         {{"own", 0, 1, 1, 1, 0, kPrivate, 0}, {"set", 0x1000, 5, 5, 1, 0, kShared, 0}}},
+         {{kSetObject, 0x7000, 5, 1}}, {},
+         {{"own", 0, 1, 1, 1, 0, kPrivate, 0}, {"set", 0x7000, 5, 5, 1, 0, kShared, 0}}},
         {"all shared: no own part",
          "1000-3000 rw-p 0 00:00 0 \nRss: 8 kB\nAnonymous: 8 kB\nShared_Dirty: 8 kB\nVmFlags: rd wr\n",
-         {{kSetObject, 2, 0}}, {}, {{"set", 0x1000, 2, 2, 0, 0, kShared, 0}}},
+         {{kSetObject, 0, 2, 0}}, {}, {{"set", 0, 2, 2, 0, 0, kShared, 0}}},
         {"a shared mapping touched in parts counts the object's pages in its range",
          "1000-11000 rw-s 0 00:01 12 /dev/shm/pool\nRss: 16 kB\nShared_Dirty: 16 kB\nVmFlags: rd wr sh\n", {},
          vs::ObjectPages{16, 16}, {{"file 0:1 inode 12", 0, 16, 16, 0, 0, kShared, 0}}},
@@ -227,9 +227,22 @@ TEST(LinuxObjectIds, WhatMakesTwoMappingsOneObject) {
     std::vector<uint32_t> distinct = {libcText, libcData, otherDevice, shared, vdso, vvar, anon, anonAgain, heap, segment};
     std::sort(distinct.begin(), distinct.end());
     EXPECT_EQ(distinct, (std::vector<uint32_t>{1, 2, 3, 4, 5, 6, 7, 8, 9, 10})) << "distinct, dense, never 0";
-    EXPECT_EQ(ids.idForFrameSet(3, 0x1000), ids.idForFrameSet(3, 0x1000));
-    EXPECT_NE(ids.idForFrameSet(3, 0x1000), ids.idForFrameSet(4, 0x1000));
-    EXPECT_NE(ids.idForFrameSet(3, 0x1000), ids.idForFrameSet(3, 0x2000));
+    // Pages several targets map: one object per set and kind of mapping.
+    const uint32_t heapCopies = ids.idForFrameSet(3, 5, 0, 0, 0, "[heap]");
+    const uint32_t dataCopies = ids.idForFrameSet(3, 0, 0xfe00000000, 332835, 0x1d3000, "/usr/lib/libc.so.6");
+    EXPECT_EQ(ids.idForFrameSet(3, 5, 0, 0, 0x1000, "[heap]"), heapCopies) << "no file: no offset";
+    EXPECT_EQ(ids.idForFrameSet(3, 0, 0xfe00000000, 332835, 0x1d3000, "/usr/lib/libc.so.6"), dataCopies);
+    const uint32_t others[] = {
+        ids.idForFrameSet(4, 5, 0, 0, 0, "[heap]"),                                  // another set
+        ids.idForFrameSet(3, 0, 0, 0, 0, "[heap]"),                                  // another tag
+        ids.idForFrameSet(3, 0, 0, 0, 0, ""),                                        // plain anonymous
+        ids.idForFrameSet(3, 0, 0xfe00000000, 332835, 0x1d4000, "/usr/lib/libc.so.6"), // another window
+        ids.idForFrameSet(3, 0, 0xfe00000000, 332836, 0x1d3000, "/usr/lib/libc.so.6"), // another file
+    };
+    std::vector<uint32_t> all(std::begin(others), std::end(others));
+    all.insert(all.end(), {heapCopies, dataCopies});
+    std::sort(all.begin(), all.end());
+    EXPECT_EQ(std::adjacent_find(all.begin(), all.end()), all.end());
 }
 
 TEST(LinuxElfImages, SegmentsAndBias) {

@@ -850,6 +850,8 @@ void VSLinuxPlatform::_buildParts(Task &task) {
     std::vector<vs::SharedAnonymousPart> shared;
     thread_local std::vector<vs::KeyRun> runs;
     thread_local std::vector<vs::SharedPageIndex::SetPages> sets;
+    // Where this target's next part of each set's object begins.
+    std::unordered_map<uint32_t, uint64_t> nextInSet;
     for (uint32_t i = 0; i < task.regions.size(); ++i) {
         const SmapsRegion &region = task.regions[i];
         const vs::MappingKind kind = task.kinds[i];
@@ -876,8 +878,13 @@ void VSLinuxPlatform::_buildParts(Task &task) {
             }
             // Pages no other target maps stay the mapping's own.
             _sharedPages.sharedPages(runs, sets);
+            const bool file = region.inode != 0 && kind != vs::MappingKind::Anonymous;
             for (const vs::SharedPageIndex::SetPages &set : sets) {
-                shared.push_back({ids.idForFrameSet(set.set, region.start), set.presentPages, set.swappedPages});
+                const uint32_t id = ids.idForFrameSet(set.set, task.tags[i], file ? vs::objectDevice(region) : 0,
+                                                      file ? region.inode : 0, region.offset, region.path);
+                uint64_t &next = nextInSet[id];
+                shared.push_back({id, next, set.presentPages, set.swappedPages});
+                next += region.size();
             }
         } else if (resolved && _isSharedWindow(region, kind)) {
             const uint64_t first = region.offset / _pageSize;
