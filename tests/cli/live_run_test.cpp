@@ -1,6 +1,8 @@
 // Whole runs against live children whose memory the test arranged, and interrupted.
 
+#include <cinttypes>
 #include <fstream>
+#include <set>
 #include <sys/ioctl.h>
 #include <nlohmann/json.hpp>
 #include <regex>
@@ -132,6 +134,82 @@ TEST(LiveRun, ForkFamiliesCountEachPageOnce) {
             EXPECT_LT(own, scene.childOwn + MiB) << child << run.out;
         }
     }
+}
+
+// The file pages of `path` that process `pid` has mapped, by the kernel's
+// page map (the kernel maps pages around the one read, so reads alone do
+// not tell).
+std::set<uint64_t> mappedFilePages(pid_t pid, const std::string &path) {
+    std::set<uint64_t> pages;
+    std::ifstream maps("/proc/" + std::to_string(pid) + "/maps");
+    const int pagemap = open(("/proc/" + std::to_string(pid) + "/pagemap").c_str(), O_RDONLY);
+    for (std::string line; pagemap >= 0 && std::getline(maps, line);) {
+        if (line.size() < path.size() || line.compare(line.size() - path.size(), path.size(), path) != 0) continue;
+        uint64_t start = 0, end = 0, offset = 0;
+        char perms[5] = {};
+        if (std::sscanf(line.c_str(), "%" SCNx64 "-%" SCNx64 " %4s %" SCNx64, &start, &end, perms, &offset) != 4) continue;
+        for (uint64_t page = 0; page < (end - start) / kPage; ++page) {
+            uint64_t entry = 0;
+            if (pread(pagemap, &entry, sizeof entry, static_cast<off_t>((start / kPage + page) * sizeof entry)) ==
+                    sizeof entry &&
+                (entry >> 63) != 0) {
+                pages.insert(offset / kPage + page);
+            }
+        }
+    }
+    if (pagemap >= 0) close(pagemap);
+    return pages;
+}
+
+// A file that processes map privately and read in different parts: its page
+// cache counts once, as the union of the pages they hold.
+TEST(LiveRun, PrivateMappingsOfOneFileHoldTheUnionOfTheirPages) {
+    if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";
+    // Next to the test programs: a disk file system, whose pages are page cache.
+    const std::string path = VESTAGE_TEST_BIN_DIR "/vs_window_test_" + std::to_string(getpid());
+    const uint64_t pages = 64; // a multiple of the kernel's fault-around window
+    {
+        std::ofstream out(path, std::ios::binary);
+        out << std::string(pages * kPage, 'w');
+    }
+    const int fd = open(path.c_str(), O_RDONLY);
+    ASSERT_GE(fd, 0);
+    fsync(fd); // clean page cache: every page a clean one
+    close(fd);
+    auto reads = [&](uint64_t first, uint64_t count) {
+        return "file:f:" + path + ":" + std::to_string(first) + ":" + std::to_string(count);
+    };
+    struct Scene {
+        const char *what;
+        std::vector<std::string> first, second;
+        bool eachHoldsSome; // pages the other does not hold
+    };
+    const Scene scenes[] = {
+        {"each reads its own end", {reads(0, 8)}, {reads(pages - 8, 8)}, true},
+        {"both read the same half", {reads(0, pages / 2)}, {reads(0, pages / 2)}, false},
+        {"one reads it all", {reads(0, pages)}, {reads(pages / 2, 4)}, false},
+    };
+    for (const Scene &scene : scenes) {
+        SCOPED_TRACE(scene.what);
+        MemChild a(scene.first), b(scene.second);
+        ASSERT_TRUE(a.ready() && b.ready());
+        // What the kernel says they hold, together and each.
+        const std::set<uint64_t> heldByA = mappedFilePages(a.pid(), path), heldByB = mappedFilePages(b.pid(), path);
+        std::set<uint64_t> held = heldByA;
+        held.insert(heldByB.begin(), heldByB.end());
+        EXPECT_EQ(held.size() > std::max(heldByA.size(), heldByB.size()), scene.eachHoldsSome);
+        const auto run = runProgram({"-f", "bytes", "-p", std::to_string(a.pid()), "-p", std::to_string(b.pid())});
+        ASSERT_EQ(run.status, 0) << run.err;
+        // The clean column of the summary's row.
+        const size_t at = run.out.find("Summary Vestage"), row = run.out.find("    mapped file\n", at);
+        ASSERT_NE(row, std::string::npos) << run.out;
+        std::istringstream fields(run.out.substr(run.out.rfind('\n', row) + 1));
+        uint64_t dirty = 0, clean = 0;
+        std::string unit;
+        fields >> dirty >> unit >> clean;
+        EXPECT_EQ(dirty + clean, held.size() * kPage) << run.out;
+    }
+    unlink(path.c_str());
 }
 
 // Without the right to read page frames, pages shared after fork stay each

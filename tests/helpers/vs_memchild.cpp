@@ -8,8 +8,9 @@
 //                                private anonymous memory, first TOUCHED
 //                                pages written, the READ pages after them
 //                                only read (the kernel's shared zero page)
-//   file:LABEL:PATH              PATH mapped read-only and private, every
-//                                page read
+//   file:LABEL:PATH[:FIRST:COUNT]
+//                                PATH mapped read-only and private, every
+//                                page read (or pages FIRST to FIRST+COUNT)
 //   shared:LABEL:PAGES[:TOUCHED] shared anonymous memory, every page (or the
 //                                first TOUCHED pages) written
 //   pfile:LABEL:PATH:WRITTEN     PATH mapped private and writable, every
@@ -258,7 +259,7 @@ int main(int argc, char **argv) {
             char *start = mapFile(item[2], MAP_SHARED, pages);
             remember(label, start, pages);
             printRegion(label, start, pages);
-        } else if (kind == "file" && item.size() == 3) {
+        } else if (kind == "file" && (item.size() == 3 || item.size() == 5)) {
             const int fd = open(item[2].c_str(), O_RDONLY | O_CLOEXEC);
             struct stat st {};
             if (fd < 0 || fstat(fd, &st) != 0) {
@@ -271,8 +272,10 @@ int main(int argc, char **argv) {
                 fail("mmap file");
             }
             close(fd);
+            const size_t first = item.size() == 5 ? std::min(pages, number(item[3])) : 0;
+            const size_t count = item.size() == 5 ? std::min(pages - first, number(item[4])) : pages;
             unsigned sum = 0;
-            for (size_t p = 0; p < pages; ++p) {
+            for (size_t p = first; p < first + count; ++p) {
                 sum += static_cast<unsigned char>(start[p * kPage]);
             }
             std::printf("%s start=%lx size=%zx sum=%u\n", label.c_str(),

@@ -114,6 +114,7 @@ TEST(SharedPageIndex, AnObjectHoldsTheUnionOfItsMappingsPages) {
         std::vector<vs::SharedPageIndex::Window> windows;
         uint64_t first, count;
         std::optional<std::pair<uint64_t, uint64_t>> pages; // resident, dirty
+        std::optional<std::pair<uint64_t, uint64_t>> privatePages = {}; // the same, of private mappings
     };
     using W = vs::SharedPageIndex::Window;
     const std::vector<Case> cases = {
@@ -133,6 +134,10 @@ TEST(SharedPageIndex, AnObjectHoldsTheUnionOfItsMappingsPages) {
          std::pair<uint64_t, uint64_t>{4, 2}},
         {"another inode is another object", {W{1, 2, 0, 10, bits({1}), {}, 0}, W{1, 3, 0, 10, bits({2}), {}, 0}}, 0,
          10, {}},
+        {"private mappings' page cache is kept apart from the shared mappings'",
+         {W{1, 2, 0, 10, bits({1}), {}, 0}, W{1, 2, 0, 10, bits({2}), {}, 0, true},
+          W{1, 2, 0, 10, bits({3}), {}, 0, true}},
+         0, 10, {}, std::pair<uint64_t, uint64_t>{2, 0}},
     };
     for (const Case &c : cases) {
         SCOPED_TRACE(c.what);
@@ -140,10 +145,13 @@ TEST(SharedPageIndex, AnObjectHoldsTheUnionOfItsMappingsPages) {
         for (const W &w : c.windows) {
             index.addWindow(w);
         }
-        const auto pages = index.objectPages(1, 2, c.first, c.count);
-        ASSERT_EQ(pages.has_value(), c.pages.has_value());
-        if (pages) {
-            EXPECT_EQ(std::make_pair(pages->residentPages, pages->dirtyPages), *c.pages);
+        for (const bool privateMappings : {false, true}) {
+            const auto pages = index.objectPages(1, 2, privateMappings, c.first, c.count);
+            const auto &want = privateMappings ? c.privatePages : c.pages;
+            ASSERT_EQ(pages.has_value(), want.has_value()) << privateMappings;
+            if (pages) {
+                EXPECT_EQ(std::make_pair(pages->residentPages, pages->dirtyPages), *want);
+            }
         }
     }
 }

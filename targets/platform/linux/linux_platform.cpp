@@ -886,10 +886,10 @@ void VSLinuxPlatform::_buildParts(Task &task) {
                 shared.push_back({id, next, set.presentPages, set.swappedPages});
                 next += region.size();
             }
-        } else if (resolved && _isSharedWindow(region, kind)) {
-            const uint64_t first = region.offset / _pageSize;
-            const uint64_t device = vs::objectDevice(region);
-            objectPages = _sharedPages.objectPages(device, region.inode, first, region.size() / _pageSize);
+        }
+        if (resolved && (_isSharedWindow(region, kind) || _isPrivateWindow(region, kind))) {
+            objectPages = _sharedPages.objectPages(vs::objectDevice(region), region.inode, !region.shared,
+                                                   region.offset / _pageSize, region.size() / _pageSize);
         }
         task.firstPart.push_back(static_cast<uint32_t>(task.parts.size()));
         for (VSRegionInfo &part : vs::regionPartsFor(region, kind, task.tags[i], ids, _pageSize, shared, objectPages)) {
@@ -1083,20 +1083,16 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
     }
     UniqueFd pagemap;
     thread_local std::vector<vs::KeyRun> runs;
-    std::vector<std::pair<uint64_t, uint64_t>> frames; // frame, page of the mapping
     bool framesUnreadable = false;
     bool any = false;
     for (size_t i = 0; i < task->regions.size(); ++i) {
         const SmapsRegion &region = task->regions[i];
         const vs::MappingKind kind = task->kinds[i];
         const bool anonymous = vs::mayShareAnonymousPages(region, kind);
-        const bool window = !anonymous && _isSharedWindow(region, kind);
+        const bool window = _isSharedWindow(region, kind) || _isPrivateWindow(region, kind);
         if (!anonymous && !window) {
             continue;
         }
-        // A shared mapping holding its whole range is exact on its own:
-        // its walk need not wait for the others' pages.
-        any = any || anonymous || region.rss < region.size();
         if (!pagemap.valid()) {
             pagemap = UniqueFd(::openat(task->dir.get(), "pagemap", O_RDONLY | O_CLOEXEC));
             if (!pagemap.valid()) {
@@ -1105,49 +1101,17 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
             }
         }
         if (anonymous) {
+            any = true;
             runs.clear();
             _candidateKeys(pagemap.get(), region, runs, &framesUnreadable);
             _sharedPages.addPages(task->pid, runs);
             const size_t before = task->storedBytes.size();
             vs::encodeKeyRuns(runs, task->storedBytes);
             task->storedKeys.push_back({region.start, region.end, before, task->storedBytes.size() - before});
-            continue;
         }
-        // A shared mapping: which file pages it holds, and which of them are
-        // dirty (shmem pages are all dirty; page cache says per frame).
-        vs::SharedPageIndex::Window pages;
-        pages.device = vs::objectDevice(region);
-        pages.inode = region.inode;
-        pages.firstPage = region.offset / _pageSize;
-        pages.pageCount = region.size() / _pageSize;
-        pages.dirtyCount = (region.privateDirty + region.sharedDirty) / _pageSize;
-        const bool shmem = kind == vs::MappingKind::SharedMemory;
-        const bool whole = region.rss == region.size();
-        if (region.rss == 0) {
-            pages.present.assign(1, 0);
-        } else if (!whole) {
-            pages.present.assign((pages.pageCount + 63) / 64, 0);
-            frames.clear();
-            _readPagemap(pagemap.get(), region.start, pages.pageCount, region.rss / _pageSize,
-                         [&](std::span<const uint64_t> entries, uint64_t first) {
-                             for (size_t k = 0; k < entries.size(); ++k) {
-                                 if ((entries[k] & kPagemapPresent) != 0) {
-                                     pages.present[(first + k) / 64] |= 1ull << ((first + k) % 64);
-                                     frames.emplace_back(entries[k] & kPagemapPfnMask, first + k);
-                                 }
-                             }
-                             return true;
-                         });
-            if (!shmem && !frames.empty() && frames.front().first != 0) {
-                pages.dirty.assign(pages.present.size(), 0);
-                _forEachDirtyFrame(frames, [&](uint64_t page) { pages.dirty[page / 64] |= 1ull << (page % 64); });
-            }
+        if (window) {
+            any = _addWindow(pagemap.get(), region, kind) || any;
         }
-        if (shmem) {
-            pages.dirty = pages.present.empty() ? std::vector<uint64_t>((pages.pageCount + 63) / 64, ~0ull)
-                                                : pages.present;
-        }
-        _sharedPages.addWindow(pages);
     }
     if (framesUnreadable) {
         _sharedFramesUnreadable.store(true);
@@ -1166,6 +1130,63 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
         std::vector<SmapsRegion>().swap(task->regions);
     }
     return any;
+}
+
+bool VSLinuxPlatform::_addWindow(int pagemapFd, const SmapsRegion &region, vs::MappingKind kind) {
+    // Which file pages the mapping holds, and which of them are dirty
+    // (shmem pages are all dirty; page cache says per frame). A private
+    // mapping's own copies are no file pages.
+    vs::SharedPageIndex::Window pages;
+    pages.device = vs::objectDevice(region);
+    pages.inode = region.inode;
+    pages.privateMapping = !region.shared;
+    pages.firstPage = region.offset / _pageSize;
+    pages.pageCount = region.size() / _pageSize;
+    const uint64_t filePages = _filePages(region);
+    pages.dirtyCount = vs::fileDirtyPages(region, _pageSize);
+    const bool shmem = kind == vs::MappingKind::SharedMemory;
+    const bool whole = filePages == pages.pageCount;
+    if (filePages == 0) {
+        pages.present.assign(1, 0);
+    } else if (!whole) {
+        pages.present.assign((pages.pageCount + 63) / 64, 0);
+        thread_local std::vector<std::pair<uint64_t, uint64_t>> frames; // frame, page of the mapping
+        frames.clear();
+        _readPagemap(pagemapFd, region.start, pages.pageCount, region.rss / _pageSize,
+                     [&](std::span<const uint64_t> entries, uint64_t first) {
+                         for (size_t k = 0; k < entries.size(); ++k) {
+                             if ((entries[k] & kPagemapPresent) != 0 &&
+                                 (region.shared || (entries[k] & kPagemapFileOrSharedAnon) != 0)) {
+                                 pages.present[(first + k) / 64] |= 1ull << ((first + k) % 64);
+                                 frames.emplace_back(entries[k] & kPagemapPfnMask, first + k);
+                             }
+                         }
+                         return true;
+                     });
+        if (!shmem && pages.dirtyCount == 0) {
+            pages.dirty.assign(pages.present.size(), 0); // smaps says none is
+        } else if (!shmem && !frames.empty() && frames.front().first != 0) {
+            pages.dirty.assign(pages.present.size(), 0);
+            _forEachDirtyFrame(frames, [&](uint64_t page) { pages.dirty[page / 64] |= 1ull << (page % 64); });
+        }
+    }
+    if (shmem) {
+        pages.dirty = pages.present.empty() ? std::vector<uint64_t>((pages.pageCount + 63) / 64, ~0ull) : pages.present;
+    }
+    _sharedPages.addWindow(pages);
+    // A mapping holding its whole range is exact on its own: its walk need
+    // not wait for the others' pages.
+    return !whole;
+}
+
+uint64_t VSLinuxPlatform::_filePages(const SmapsRegion &region) const {
+    const uint64_t resident = region.rss / _pageSize;
+    return region.shared ? resident : resident - std::min(resident, region.anonymous / _pageSize);
+}
+
+bool VSLinuxPlatform::_isPrivateWindow(const SmapsRegion &region, vs::MappingKind kind) const {
+    return !region.shared && region.inode != 0 && !region.hasFlag(vs::kVmHugetlb) &&
+           (kind == vs::MappingKind::File || kind == vs::MappingKind::SharedMemory) && _filePages(region) > 0;
 }
 
 void VSLinuxPlatform::_forEachDirtyFrame(std::vector<std::pair<uint64_t, uint64_t>> &frames,

@@ -119,6 +119,14 @@ private:
     // run's shared pages are resolved, the shared-page index.
     void _buildParts(Task &task);
     bool _isSharedWindow(const vs::SmapsRegion &region, vs::MappingKind kind) const;
+    // A private file mapping showing page cache: several processes may
+    // hold different pages of the same window.
+    bool _isPrivateWindow(const vs::SmapsRegion &region, vs::MappingKind kind) const;
+    // Page cache pages (not copies) the mapping holds.
+    uint64_t _filePages(const vs::SmapsRegion &region) const;
+    // Adds the file pages a shared or private window holds to the index;
+    // true when the mapping's own counts may fall short of the object's.
+    bool _addWindow(int pagemapFd, const vs::SmapsRegion &region, vs::MappingKind kind);
     // The keys (frame, or swap entry) of a private mapping's anonymous
     // pages that other processes may map too, appended as runs.
     void _candidateKeys(int pagemapFd, const vs::SmapsRegion &region, std::vector<vs::KeyRun> &runs,

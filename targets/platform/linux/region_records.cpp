@@ -98,6 +98,18 @@ uint32_t userTagFor(const SmapsRegion &region, MappingKind kind,
     return 0;
 }
 
+uint64_t fileDirtyPages(const SmapsRegion &region, uint64_t pageSize) {
+    const uint64_t dirty = (region.privateDirty + region.sharedDirty) / pageSize;
+    if (region.shared) {
+        return dirty;
+    }
+    // Dirty page cache (written with write()) belongs to the file; every
+    // anonymous page but a lazily freed one is dirty.
+    const uint64_t anonymous = std::min(region.anonymous, region.rss) / pageSize;
+    const uint64_t lazyFree = region.lazyFree / pageSize;
+    return dirty - std::min(dirty, anonymous - std::min(anonymous, lazyFree));
+}
+
 bool mayShareAnonymousPages(const SmapsRegion &region, MappingKind kind) {
     if (region.shared || kind == MappingKind::Special || region.hasFlag(kVmHugetlb)) {
         return false;
@@ -222,11 +234,14 @@ std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind 
     const uint64_t ownPresent = clampedDifference(anonymous, sharedPresent);
     const uint64_t ownSwapped = clampedDifference(pages(region.swap), sharedSwapped);
     if (hasFile) {
-        const uint64_t filePages = resident - anonymous;
-        // Dirty page cache (written with write()) belongs to the file; every
-        // anonymous page but a lazily freed one is dirty.
-        const uint64_t fileDirty =
-            clampedDifference(pages(region.privateDirty + region.sharedDirty), clampedDifference(anonymous, lazyFree));
+        const bool holdsFilePages = resident > anonymous;
+        uint64_t filePages = resident - anonymous;
+        uint64_t fileDirty = fileDirtyPages(region, pageSize);
+        if (objectPages && holdsFilePages) {
+            // Other mappings of the window hold other pages of it.
+            filePages = objectPages->residentPages;
+            fileDirty = objectPages->dirtyPages;
+        }
         const uint32_t id = ids.idForFileWindow(device, region.inode, region.offset);
         if (filePages > 0 || ownPresent + ownSwapped + sharedPresent + sharedSwapped == 0) {
             parts.push_back(part(common, region, id, region.offset, {filePages, fileDirty, 0, 0}, droppable,

@@ -31,6 +31,9 @@ struct SharedAnonymousPart {
     uint64_t swappedPages = 0;
 };
 
+// Dirty page cache pages of a mapping (its copies left out).
+uint64_t fileDirtyPages(const SmapsRegion &region, uint64_t pageSize);
+
 // Does the mapping hold anonymous pages that may be mapped by other
 // processes too? Only such mappings need their frames looked up.
 bool mayShareAnonymousPages(const SmapsRegion &region, MappingKind kind);

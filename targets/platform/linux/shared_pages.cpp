@@ -296,7 +296,7 @@ std::vector<int32_t> SharedPageIndex::setMembers(uint32_t set) const {
 
 void SharedPageIndex::addWindow(const Window &window) {
     std::lock_guard<std::mutex> lock(_mutex);
-    ObjectBits &object = _objects[{window.device, window.inode}];
+    ObjectBits &object = _objects[{window.device, window.inode, window.privateMapping}];
     object.mappings += 1;
     const bool whole = window.present.empty();
     for (uint64_t i = 0; i < window.pageCount; ++i) {
@@ -312,10 +312,10 @@ void SharedPageIndex::addWindow(const Window &window) {
     }
 }
 
-std::optional<ObjectPages> SharedPageIndex::objectPages(uint64_t device, uint64_t inode,
-                                                                   uint64_t firstPage, uint64_t pageCount) const {
+std::optional<ObjectPages> SharedPageIndex::objectPages(uint64_t device, uint64_t inode, bool privateMappings,
+                                                       uint64_t firstPage, uint64_t pageCount) const {
     std::lock_guard<std::mutex> lock(_mutex);
-    const auto found = _objects.find({device, inode});
+    const auto found = _objects.find({device, inode, privateMappings});
     if (found == _objects.end() || found->second.mappings < 2) {
         return std::nullopt;
     }

@@ -19,6 +19,7 @@
 #include <mutex>
 #include <optional>
 #include <span>
+#include <tuple>
 #include <unordered_map>
 #include <utility>
 #include <vector>
@@ -85,6 +86,8 @@ public:
     // page `firstPage` on (`present` empty: every page of `pageCount`);
     // `dirty` empty when the dirty state is unknown, with `dirtyCount`
     // the mapping's own count of dirty pages instead.
+    // Page cache that private mappings show is kept apart from what shared
+    // mappings of the file hold: the two are objects of their own.
     struct Window {
         uint64_t device = 0;
         uint64_t inode = 0;
@@ -93,14 +96,15 @@ public:
         std::vector<uint64_t> present;
         std::vector<uint64_t> dirty;
         uint64_t dirtyCount = 0;
+        bool privateMapping = false;
     };
     void addWindow(const Window &window);
 
     // The object's pages within [firstPage, firstPage + pageCount): how
     // many any mapping holds and how many of those are dirty. nullopt when
     // one mapping alone maps the object (its own counts are exact).
-    std::optional<ObjectPages> objectPages(uint64_t device, uint64_t inode, uint64_t firstPage,
-                                     uint64_t pageCount) const;
+    std::optional<ObjectPages> objectPages(uint64_t device, uint64_t inode, bool privateMappings,
+                                           uint64_t firstPage, uint64_t pageCount) const;
 
     // No page is added from now on: lookups need no locks.
     void freeze() { _frozen.store(true); }
@@ -167,7 +171,7 @@ private:
     std::vector<std::vector<int32_t>> _sets{{}};
     std::map<std::vector<int32_t>, uint32_t> _setIds{{{}, 0}};
     std::unordered_map<uint64_t, uint32_t> _transitions; // (set << 32 | pid) -> set
-    std::map<std::pair<uint64_t, uint64_t>, ObjectBits> _objects;
+    std::map<std::tuple<uint64_t, uint64_t, bool>, ObjectBits> _objects; // device, inode, private
 };
 
 } // namespace vs
