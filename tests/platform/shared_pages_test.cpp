@@ -12,10 +12,11 @@
 
 namespace {
 
-std::vector<vs::KeyRun> runsOf(const std::vector<uint64_t> &keys) {
+// Keys mapped at consecutive pages from `page` on.
+std::vector<vs::KeyRun> runsOf(const std::vector<uint64_t> &keys, uint64_t page = 0x1000) {
     std::vector<vs::KeyRun> runs;
     for (const uint64_t key : keys) {
-        vs::appendKey(runs, key);
+        vs::appendKey(runs, key, page++);
     }
     return runs;
 }
@@ -56,23 +57,26 @@ TEST(SharedPageIndex, EachPageBelongsToTheExactSetOfTargetsMappingIt) {
 
 TEST(SharedPageIndex, RunsAreCountedBySetAsTheIndexGrows) {
     // A parent's frames in runs of every length, across blocks and shards;
-    // a child maps every other run, a grandchild part of one.
+    // a child maps every other run (moved 1 GiB up), a grandchild part of
+    // one (far below).
     vs::SharedPageIndex index;
     std::vector<vs::KeyRun> parent, child;
-    uint64_t next = 1000, childPages = 0;
+    constexpr uint64_t kMoved = 1ull << 18;
+    uint64_t next = 1000, page = 0x50000, childPages = 0;
     for (uint64_t length = 1; length <= 700; ++length) {
-        parent.push_back({next, length});
+        parent.push_back({next, length, page});
         if (length % 2 == 0) {
-            child.push_back({next, length});
+            child.push_back({next, length, page + kMoved});
             childPages += length;
         }
         next += length + 3;
+        page += length + 1;
     }
-    parent.push_back({vs::kSwapKey | 77, 5});
-    child.push_back({vs::kSwapKey | 79, 5}); // three of the parent's slots, two of its own
+    parent.push_back({vs::kSwapKey | 77, 5, page});
+    child.push_back({vs::kSwapKey | 79, 5, page + 2 + kMoved}); // three of the parent's slots, two of its own
     index.addPages(1, parent);
     index.addPages(2, child);
-    index.addPages(3, std::vector<vs::KeyRun>{{child[10].first + 2, 7}});
+    index.addPages(3, std::vector<vs::KeyRun>{{child[10].first + 2, 7, 0x100}});
     for (const bool frozen : {false, true}) {
         SCOPED_TRACE(frozen ? "frozen" : "still adding");
         if (frozen) {
@@ -87,6 +91,17 @@ TEST(SharedPageIndex, RunsAreCountedBySetAsTheIndexGrows) {
         using Pages = std::pair<uint64_t, uint64_t>;
         EXPECT_EQ(byMembers, (std::map<std::vector<int32_t>, Pages>{{{1, 2}, {childPages - 7, 3}},
                                                                     {{1, 2, 3}, {7, 0}}}));
+        // Where the first page of each set lies, and the lowest place any
+        // member maps it: the parent's, the grandchild's.
+        for (const auto &set : sets) {
+            const bool withGrandchild = index.setMembers(set.set).size() == 3;
+            EXPECT_EQ(set.firstPage, withGrandchild ? child[10].page + 2 - kMoved : child[0].page - kMoved);
+            EXPECT_EQ(set.lowestPage, withGrandchild ? 0x100 : child[0].page - kMoved);
+        }
+        index.sharedPages(child, sets);
+        ASSERT_FALSE(sets.empty());
+        EXPECT_EQ(sets[0].firstPage, child[0].page) << "the child's own place";
+        EXPECT_EQ(sets[0].lowestPage, child[0].page - kMoved) << "the parent's, below it";
         // Page by page, wherever its run began, the same sets.
         std::map<std::vector<int32_t>, std::pair<uint64_t, uint64_t>> byPage;
         for (const vs::KeyRun &run : parent) {
@@ -98,7 +113,7 @@ TEST(SharedPageIndex, RunsAreCountedBySetAsTheIndexGrows) {
             }
         }
         EXPECT_EQ(byPage, byMembers);
-        index.sharedPages(std::vector<vs::KeyRun>{{next + 10, 4096}}, sets);
+        index.sharedPages(std::vector<vs::KeyRun>{{next + 10, 4096, 0}}, sets);
         EXPECT_TRUE(sets.empty()) << "pages nobody added";
     }
 }
@@ -175,7 +190,12 @@ TEST(SharedPageIndex, KeyRunsComeBackAsTheyWent) {
     // Consecutive frames are what make it small.
     std::vector<uint64_t> run(65536);
     for (size_t i = 0; i < run.size(); ++i) run[i] = 0x123456 + i;
-    EXPECT_EQ(runsOf(run), (std::vector<vs::KeyRun>{{0x123456, 65536}}));
+    EXPECT_EQ(runsOf(run), (std::vector<vs::KeyRun>{{0x123456, 65536, 0x1000}}));
+    std::vector<vs::KeyRun> moved;
+    vs::appendKey(moved, 5, 100);
+    vs::appendKey(moved, 6, 101);
+    vs::appendKey(moved, 7, 300);
+    EXPECT_EQ(moved, (std::vector<vs::KeyRun>{{5, 2, 100}, {7, 1, 300}})) << "a page that does not follow ends a run";
     std::vector<uint8_t> bytes;
     vs::encodeKeyRuns(runsOf(run), bytes);
     EXPECT_LT(bytes.size(), 16u);

@@ -850,8 +850,6 @@ void VSLinuxPlatform::_buildParts(Task &task) {
     std::vector<vs::SharedAnonymousPart> shared;
     thread_local std::vector<vs::KeyRun> runs;
     thread_local std::vector<vs::SharedPageIndex::SetPages> sets;
-    // Where this target's next part of each set's object begins.
-    std::unordered_map<uint32_t, uint64_t> nextInSet;
     for (uint32_t i = 0; i < task.regions.size(); ++i) {
         const SmapsRegion &region = task.regions[i];
         const vs::MappingKind kind = task.kinds[i];
@@ -878,13 +876,13 @@ void VSLinuxPlatform::_buildParts(Task &task) {
             }
             // Pages no other target maps stay the mapping's own.
             _sharedPages.sharedPages(runs, sets);
-            const bool file = region.inode != 0 && kind != vs::MappingKind::Anonymous;
             for (const vs::SharedPageIndex::SetPages &set : sets) {
-                const uint32_t id = ids.idForFrameSet(set.set, task.tags[i], file ? vs::objectDevice(region) : 0,
-                                                      file ? region.inode : 0, region.offset, region.path);
-                uint64_t &next = nextInSet[id];
-                shared.push_back({id, next, set.presentPages, set.swappedPages});
-                next += region.size();
+                // Members map their copies at the same address unless one
+                // moved its copy: then all place it where the lowest of
+                // them has it, so that it stays one object.
+                const uint64_t below = (set.firstPage - set.lowestPage) * _pageSize;
+                const uint64_t start = below <= region.start ? region.start - below : region.start;
+                shared.push_back({ids.idForFrameSet(set.set, start), start, set.presentPages, set.swappedPages});
             }
         }
         if (resolved && (_isSharedWindow(region, kind) || _isPrivateWindow(region, kind))) {
@@ -914,8 +912,10 @@ void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, s
                                      bool *framesUnreadable) {
     const uint64_t zeroPage = _zeroFrame();
     _readPagemap(pagemapFd, region.start, region.size() / _pageSize, (region.rss + region.swap) / _pageSize,
-                 [&](std::span<const uint64_t> entries, uint64_t) {
-                     for (const uint64_t entry : entries) {
+                 [&](std::span<const uint64_t> entries, uint64_t first) {
+                     const uint64_t firstPage = region.start / _pageSize + first;
+                     for (size_t k = 0; k < entries.size(); ++k) {
+                         const uint64_t entry = entries[k];
                          uint64_t key = 0;
                          if ((entry & kPagemapPresent) != 0) {
                              // Page cache of a file mapping, and pages only
@@ -941,7 +941,7 @@ void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, s
                              }
                              continue;
                          }
-                         vs::appendKey(runs, key);
+                         vs::appendKey(runs, key, firstPage + k);
                      }
                      return true;
                  });

@@ -27,13 +27,8 @@ uint32_t ObjectIdTable::idForName(std::string_view name) {
     return _idFor(Key{Kind::Name, 0, 0, 0, std::string(name)});
 }
 
-uint32_t ObjectIdTable::idForFrameSet(uint32_t set, uint32_t tag, uint64_t device, uint64_t inode,
-                                     uint64_t fileOffset, std::string_view path) {
-    std::string what(path);
-    if (inode != 0) {
-        what += '\0' + std::to_string(fileOffset);
-    }
-    return _idFor(Key{Kind::FrameSet, uint64_t{set} << 32 | tag, device, inode, std::move(what)});
+uint32_t ObjectIdTable::idForFrameSet(uint32_t set, uint64_t address) {
+    return _idFor(Key{Kind::FrameSet, set, address, 0, {}});
 }
 
 uint32_t ObjectIdTable::freshId() {

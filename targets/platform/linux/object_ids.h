@@ -13,10 +13,8 @@
 //   - [vdso], [vvar], [vvar_vclock], [vsyscall]: one id per name (the same
 //     kernel pages in every process);
 //   - anonymous pages several targets map (copy-on-write after fork, KSM):
-//     one id per set of targets (from the run's frame index) and kind of
-//     mapping that holds them (its tag, and its file window or name), so
-//     that the copies of a library's data and those of the heap stay
-//     objects (and rows) of their own, wherever each process maps them;
+//     one id per (set of targets, address), from the run's frame index
+//     (the address where the member mapping them lowest has them);
 //   - any other anonymous memory: a fresh id per mapping.
 // Ids are dense from 1, so they fit 32 bits and 0 (no object) never occurs.
 
@@ -35,9 +33,7 @@ public:
     uint32_t idForFile(uint64_t device, uint64_t inode);
     uint32_t idForFileWindow(uint64_t device, uint64_t inode, uint64_t offset);
     uint32_t idForName(std::string_view name);
-    // `fileOffset` only counts where there is a file (device, inode).
-    uint32_t idForFrameSet(uint32_t set, uint32_t tag, uint64_t device, uint64_t inode, uint64_t fileOffset,
-                           std::string_view path);
+    uint32_t idForFrameSet(uint32_t set, uint64_t address);
     uint32_t freshId();
 
     // What an id stands for in terms that mean the same in another run

@@ -257,9 +257,9 @@ std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind 
         if (set.presentPages + set.swappedPages == 0) {
             continue;
         }
-        // Every member maps every page of the set: each lays its parts out
-        // one after the other in the set's object, so that the object
-        // holds as many pages as one member maps, however many map them.
+        // Shared copies sit at the same address in every process of a fork
+        // family: the address places them in the set's object, so each
+        // frame counts once however many members map it.
         parts.push_back(part(common, region, set.objectId, set.offset,
                              {set.presentPages, set.presentPages, set.swappedPages, 0}, false, kShareModeShared));
     }

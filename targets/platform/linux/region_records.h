@@ -25,7 +25,7 @@ uint32_t userTagFor(const SmapsRegion &region, MappingKind kind,
 // Anonymous pages of a private mapping that other targets map too (after
 // fork, or merged by KSM): one set of targets' share of the mapping.
 struct SharedAnonymousPart {
-    uint32_t objectId = 0;   // the set's object for this kind of mapping
+    uint32_t objectId = 0;   // the set's object at this address
     uint64_t offset = 0;     // where the part lies in that object
     uint64_t presentPages = 0;
     uint64_t swappedPages = 0;

@@ -46,39 +46,53 @@ size_t slotOf(uint64_t key, size_t mask) {
 
 } // namespace
 
+namespace {
+
+// A distance either way, its sign in the lowest bit.
+void putDistance(std::vector<uint8_t> &out, uint64_t distance) {
+    vs::putPackedNumber(out, (distance << 1) ^ static_cast<uint64_t>(static_cast<int64_t>(distance) >> 63));
+}
+
+uint64_t takeDistance(std::span<const uint8_t> bytes, size_t &at) {
+    const uint64_t coded = vs::takePackedNumber(bytes, at);
+    return (coded >> 1) ^ (0 - (coded & 1));
+}
+
+} // namespace
+
 void encodeKeyRuns(std::span<const KeyRun> runs, std::vector<uint8_t> &out) {
-    uint64_t next = 0; // the key after the last run
+    uint64_t next = 0, nextPage = 0; // the key and the page after the last run
     for (const KeyRun &run : runs) {
-        // The distance either way, its sign in the lowest bit.
-        const uint64_t distance = run.first - next;
-        vs::putPackedNumber(out, (distance << 1) ^ static_cast<uint64_t>(static_cast<int64_t>(distance) >> 63));
+        putDistance(out, run.first - next);
         vs::putPackedNumber(out, run.length);
+        putDistance(out, run.page - nextPage);
         next = run.first + run.length;
+        nextPage = run.page + run.length;
     }
 }
 
 void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<KeyRun> &runs) {
-    uint64_t next = 0;
+    uint64_t next = 0, nextPage = 0;
     for (size_t at = 0; at < bytes.size();) {
-        const uint64_t coded = vs::takePackedNumber(bytes, at);
-        const uint64_t distance = (coded >> 1) ^ (0 - (coded & 1));
+        const uint64_t first = next + takeDistance(bytes, at);
         const uint64_t length = vs::takePackedNumber(bytes, at);
-        const uint64_t first = next + distance;
+        const uint64_t page = nextPage + takeDistance(bytes, at);
         if (length != 0) {
-            runs.push_back({first, length});
+            runs.push_back({first, length, page});
         }
         next = first + length;
+        nextPage = page + length;
     }
 }
 
-const uint32_t *SharedPageIndex::PageTable::find(uint64_t block) const {
+const SharedPageIndex::Lane *SharedPageIndex::PageTable::find(uint64_t block) const {
     if (_blocks.empty()) {
         return nullptr;
     }
     const size_t mask = _blocks.size() - 1;
     for (size_t slot = slotOf(block, mask);; slot = (slot + 1) & mask) {
         if (_blocks[slot] == block + 1) {
-            return &_sets[slot * kLanes];
+            return &_lanes[slot * kLanes];
         }
         if (_blocks[slot] == 0) {
             return nullptr;
@@ -86,7 +100,7 @@ const uint32_t *SharedPageIndex::PageTable::find(uint64_t block) const {
     }
 }
 
-uint32_t *SharedPageIndex::PageTable::findOrAdd(uint64_t block) {
+SharedPageIndex::Lane *SharedPageIndex::PageTable::findOrAdd(uint64_t block) {
     if ((_count + 1) * 10 > _blocks.size() * 7) {
         _grow();
     }
@@ -99,12 +113,12 @@ uint32_t *SharedPageIndex::PageTable::findOrAdd(uint64_t block) {
         _blocks[slot] = block + 1;
         ++_count;
     }
-    return &_sets[slot * kLanes];
+    return &_lanes[slot * kLanes];
 }
 
 void SharedPageIndex::PageTable::_grow() {
     std::vector<uint64_t> blocks(std::max<size_t>(1024, _blocks.size() * 2), 0);
-    std::vector<uint32_t> sets(blocks.size() * kLanes, 0);
+    std::vector<Lane> lanes(blocks.size() * kLanes);
     const size_t mask = blocks.size() - 1;
     for (size_t i = 0; i < _blocks.size(); ++i) {
         if (_blocks[i] != 0) {
@@ -113,16 +127,16 @@ void SharedPageIndex::PageTable::_grow() {
                 slot = (slot + 1) & mask;
             }
             blocks[slot] = _blocks[i];
-            std::copy_n(&_sets[i * kLanes], kLanes, &sets[slot * kLanes]);
+            std::copy_n(&_lanes[i * kLanes], kLanes, &lanes[slot * kLanes]);
         }
     }
     _blocks.swap(blocks);
-    _sets.swap(sets);
+    _lanes.swap(lanes);
 }
 
 void SharedPageIndex::PageTable::clear() {
     std::vector<uint64_t>().swap(_blocks);
-    std::vector<uint32_t>().swap(_sets);
+    std::vector<Lane>().swap(_lanes);
     _count = 0;
 }
 
@@ -168,32 +182,37 @@ void SharedPageIndex::_forEachPiece(const KeyRun &run, Piece &&piece) {
 template <typename Each>
 void SharedPageIndex::_setsOf(size_t shard, uint64_t first, uint64_t length, Each &&each) const {
     const PageTable &table = _shards[shard].pages;
+    const Lane none;
     uint32_t stretchSet = 0;
-    uint64_t stretch = 0;
+    uint64_t stretch = 0, stretchStart = 0, stretchLowest = UINT64_MAX;
     for (uint64_t key = first, left = length; left > 0;) {
-        const uint32_t *lanes = table.find(key >> kBlockShift);
+        const Lane *lanes = table.find(key >> kBlockShift);
         const uint64_t lane = key & (PageTable::kLanes - 1);
         const uint64_t count = std::min<uint64_t>(left, PageTable::kLanes - lane);
         for (uint64_t k = lane; k < lane + count; ++k) {
-            const uint32_t set = lanes == nullptr ? 0 : lanes[k];
-            if (set != stretchSet && stretch > 0) {
-                each(stretchSet, stretch);
+            const Lane &found = lanes == nullptr ? none : lanes[k];
+            if (found.set != stretchSet || stretch == 0) {
+                if (stretch > 0) {
+                    each(stretchSet, stretch, stretchStart, stretchLowest);
+                }
+                stretchSet = found.set;
+                stretchStart = key - first + (k - lane);
+                stretchLowest = found.lowestPage;
                 stretch = 0;
             }
-            stretchSet = set;
             ++stretch;
         }
         key += count;
         left -= count;
     }
     if (stretch > 0) {
-        each(stretchSet, stretch);
+        each(stretchSet, stretch, stretchStart, stretchLowest);
     }
 }
 
 void SharedPageIndex::addPages(int32_t pid, std::span<const KeyRun> runs) {
-    // (first key, length) of the pieces of the runs, by shard.
-    thread_local std::array<std::vector<std::pair<uint64_t, uint64_t>>, kShards> byShard;
+    // The pieces of the runs, by shard.
+    thread_local std::array<std::vector<KeyRun>, kShards> byShard;
     for (auto &pieces : byShard) {
         pieces.clear();
     }
@@ -202,9 +221,10 @@ void SharedPageIndex::addPages(int32_t pid, std::span<const KeyRun> runs) {
             // Key 0 is a hidden frame number: nobody's page.
             run.first = 1;
             run.length -= 1;
+            run.page += 1;
         }
         _forEachPiece(run, [&](size_t shard, uint64_t first, uint64_t length) {
-            byShard[shard].emplace_back(first, length);
+            byShard[shard].push_back({first, length, run.page + (first - run.first)});
         });
     }
     // A target takes each set it meets to one other set (itself added):
@@ -228,17 +248,19 @@ void SharedPageIndex::addPages(int32_t pid, std::span<const KeyRun> runs) {
         std::lock_guard<std::mutex> lock(_shards[shard].mutex);
         // Neighbouring pages are mostly in the same set: the last step first.
         uint32_t lastFrom = UINT32_MAX, lastTo = 0;
-        for (const auto &[first, length] : byShard[shard]) {
-            for (uint64_t key = first, left = length; left > 0;) {
-                uint32_t *lanes = _shards[shard].pages.findOrAdd(key >> kBlockShift);
+        for (const KeyRun &piece : byShard[shard]) {
+            for (uint64_t key = piece.first, left = piece.length; left > 0;) {
+                Lane *lanes = _shards[shard].pages.findOrAdd(key >> kBlockShift);
                 const uint64_t lane = key & (PageTable::kLanes - 1);
                 const uint64_t count = std::min<uint64_t>(left, PageTable::kLanes - lane);
+                const uint64_t page = piece.page + (key - piece.first);
                 for (uint64_t k = lane; k < lane + count; ++k) {
-                    if (lanes[k] != lastFrom) {
-                        lastFrom = lanes[k];
+                    if (lanes[k].set != lastFrom) {
+                        lastFrom = lanes[k].set;
                         lastTo = step(lastFrom);
                     }
-                    lanes[k] = lastTo;
+                    lanes[k].set = lastTo;
+                    lanes[k].lowestPage = std::min(lanes[k].lowestPage, page + (k - lane));
                 }
                 key += count;
                 left -= count;
@@ -249,7 +271,7 @@ void SharedPageIndex::addPages(int32_t pid, std::span<const KeyRun> runs) {
 
 std::optional<uint32_t> SharedPageIndex::sharedSet(uint64_t key) const {
     std::vector<SetPages> sets;
-    const KeyRun run{key, 1};
+    const KeyRun run{key, 1, 0};
     sharedPages(std::span<const KeyRun>(&run, 1), sets);
     return sets.empty() ? std::nullopt : std::optional<uint32_t>(sets[0].set);
 }
@@ -259,18 +281,19 @@ void SharedPageIndex::sharedPages(std::span<const KeyRun> runs, std::vector<SetP
     const bool frozen = _frozen.load();
     for (const KeyRun &run : runs) {
         const bool swapped = (run.first & kSwapKey) != 0;
-        // A region meets few sets: a short list beats a map.
-        auto add = [&](uint32_t set, uint64_t count) {
-            auto entry = out.begin();
-            while (entry != out.end() && entry->set != set) {
-                ++entry;
-            }
-            if (entry == out.end()) {
-                entry = out.insert(out.end(), SetPages{set, 0, 0});
-            }
-            (swapped ? entry->swappedPages : entry->presentPages) += count;
-        };
         _forEachPiece(run, [&](size_t shard, uint64_t first, uint64_t length) {
+            // A region meets few sets: a short list beats a map.
+            auto add = [&](uint32_t set, uint64_t count, uint64_t skipped, uint64_t lowestPage) {
+                auto entry = out.begin();
+                while (entry != out.end() && entry->set != set) {
+                    ++entry;
+                }
+                if (entry == out.end()) {
+                    const uint64_t page = run.page + (first - run.first) + skipped;
+                    entry = out.insert(out.end(), SetPages{set, 0, 0, page, std::min(page, lowestPage)});
+                }
+                (swapped ? entry->swappedPages : entry->presentPages) += count;
+            };
             if (frozen) {
                 _setsOf(shard, first, length, add);
                 return;

@@ -32,24 +32,29 @@ inline constexpr uint64_t kSwapKey = 1ull << 63;
 
 // Keys of consecutive pages mostly follow each other (neighbouring frames,
 // neighbouring swap slots): they travel as runs, and the index works a run
-// at a time.
+// at a time. A run also says at which virtual page of its process its first
+// key is mapped; the pages of a run are consecutive there too.
 struct KeyRun {
     uint64_t first = 0;
     uint64_t length = 0;
+    uint64_t page = 0; // address / page size
     bool operator==(const KeyRun &) const = default;
 };
-// Appends `key` to `runs`, extending the last run when it follows it.
-inline void appendKey(std::vector<KeyRun> &runs, uint64_t key) {
-    if (!runs.empty() && runs.back().first + runs.back().length == key) {
+// Appends `key`, mapped at virtual page `page`, to `runs`, extending the
+// last run when it follows it.
+inline void appendKey(std::vector<KeyRun> &runs, uint64_t key, uint64_t page) {
+    if (!runs.empty() && runs.back().first + runs.back().length == key &&
+        runs.back().page + runs.back().length == page) {
         runs.back().length += 1;
     } else {
-        runs.push_back({key, 1});
+        runs.push_back({key, 1, page});
     }
 }
 
 // A process's page keys kept between its first look and its walk, small:
-// each run as (distance from the end of the last run, length), each a
-// variable-length number.
+// each run as (distance from the end of the last run, length, distance of
+// its page from where the last run's pages end), each a variable-length
+// number.
 void encodeKeyRuns(std::span<const KeyRun> runs, std::vector<uint8_t> &out);
 // Appends the runs of `bytes` (as encodeKeyRuns wrote them) to `runs`.
 void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<KeyRun> &runs);
@@ -73,10 +78,15 @@ public:
     std::optional<uint32_t> sharedSet(uint64_t key) const;
     // How many of the pages of `runs` lie in each set of more than one
     // target, swapped pages apart; pages of one target alone are left out.
+    // Of the first page met in each set: the virtual page it is mapped at in
+    // `runs`, and the lowest virtual page any target maps it at (where a
+    // member moved its copy with mremap, the two differ).
     struct SetPages {
         uint32_t set = 0;
         uint64_t presentPages = 0;
         uint64_t swappedPages = 0;
+        uint64_t firstPage = 0;
+        uint64_t lowestPage = 0;
     };
     void sharedPages(std::span<const KeyRun> runs, std::vector<SetPages> &out) const;
     // The pids of a set, sorted.
@@ -132,22 +142,30 @@ private:
     template <typename Piece>
     static void _forEachPiece(const KeyRun &run, Piece &&piece);
     // The set of every page of [first, first + length) in `shard`, to
-    // `each(set, count)` by stretches of pages in the same set.
+    // `each(set, count, skipped, lowestPage)` by stretches of pages in the
+    // same set: `skipped` pages of the piece before the stretch, and the
+    // lowest virtual page of its first page.
     template <typename Each>
     void _setsOf(size_t shard, uint64_t first, uint64_t length, Each &&each) const;
+    // What the index knows of one key: its set, and the lowest virtual
+    // page at which a target maps it.
+    struct Lane {
+        uint32_t set = 0;
+        uint64_t lowestPage = UINT64_MAX;
+    };
     class PageTable {
     public:
         static constexpr size_t kLanes = size_t{1} << kBlockShift;
-        // The sets of a block's keys, or null when none was added.
-        const uint32_t *find(uint64_t block) const;
+        // The lanes of a block's keys, or null when none was added.
+        const Lane *find(uint64_t block) const;
         // The same, made when missing; valid until the next call.
-        uint32_t *findOrAdd(uint64_t block);
+        Lane *findOrAdd(uint64_t block);
         void clear();
 
     private:
         void _grow();
         std::vector<uint64_t> _blocks; // block + 1; 0: a free slot
-        std::vector<uint32_t> _sets;   // kLanes per slot
+        std::vector<Lane> _lanes;      // kLanes per slot
         size_t _count = 0;
     };
 
