@@ -797,28 +797,29 @@ const std::unordered_map<uint64_t, bool> &VSLinuxPlatform::_openableDevices() {
 }
 
 VSReturnCode VSLinuxPlatform::_parse(Task &task) {
-    ReadBuffer &buffer = vs::threadReadBuffer();
-    std::string_view text;
+    // Parsed as it is read: the text of a process with many mappings is
+    // never held whole.
+    vs::SmapsParser parser(task.regions);
+    const auto consume = [&parser](std::string_view text) { return parser.feed(text); };
+    uint64_t bytes = 0;
     int error = 0;
     if (task.smaps.valid()) {
-        error = vs::readAll(task.smaps.get(), buffer, text, vs::kRecordFileChunk);
+        error = vs::readInPieces(task.smaps.get(), vs::kRecordFileChunk, consume, bytes);
         // Opened before an exec, the file shows the address space the
         // process has left: empty. Its new one needs a new open.
-        if (error == 0 && text.empty()) {
+        if (error == 0 && bytes == 0) {
             task.smaps = UniqueFd();
         }
     }
     if (!task.smaps.valid()) {
         task.smaps = UniqueFd(::openat(task.dir.get(), "smaps", O_RDONLY | O_CLOEXEC));
-        error = task.smaps.valid() ? vs::readAll(task.smaps.get(), buffer, text, vs::kRecordFileChunk) : errno;
+        error = task.smaps.valid() ? vs::readInPieces(task.smaps.get(), vs::kRecordFileChunk, consume, bytes) : errno;
     }
     task.smaps = UniqueFd(); // a parse asked for again reads anew
     if (error != 0) {
+        std::vector<SmapsRegion>().swap(task.regions);
         return (error == ESRCH || error == ENOENT) ? vs::kReturnDeadPort : regionErrno(error);
     }
-    // About 700 bytes of text per mapping; a close guess saves regrowing.
-    task.regions.reserve(text.size() / 640 + 1);
-    vs::parseSmaps(text, task.regions);
     if (task.regions.empty() && processHasGone(task.dir.get())) {
         return vs::kReturnDeadPort;
     }

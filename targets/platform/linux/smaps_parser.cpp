@@ -295,15 +295,13 @@ const char *findNewline(const char *p, const char *end) {
 
 } // namespace
 
-size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out) {
-    const size_t before = out.size();
-    bool inRegion = false;
+size_t SmapsParser::feed(std::string_view text) {
     const char *p = text.data();
     const char *const end = p + text.size();
     while (p < end) {
         const char *newline = findNewline(p, end);
         if (newline == nullptr) {
-            break; // cut short: the last line is incomplete
+            break; // the rest of the line has not arrived (or never will)
         }
         const char *line = p;
         p = newline + 1;
@@ -312,15 +310,21 @@ size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out) {
         }
         const char first = *line;
         if ((first >= '0' && first <= '9') || (first >= 'a' && first <= 'f')) {
-            SmapsRegion &region = out.emplace_back();
-            inRegion = parseHeader(LineCursor{line, newline}, region);
-            if (!inRegion) {
-                out.pop_back();
+            SmapsRegion &region = _out.emplace_back();
+            _inRegion = parseHeader(LineCursor{line, newline}, region);
+            if (!_inRegion) {
+                _out.pop_back();
             }
-        } else if (inRegion && first >= 'A' && first <= 'Z') {
-            parseField(line, newline, out.back());
+        } else if (_inRegion && first >= 'A' && first <= 'Z') {
+            parseField(line, newline, _out.back());
         }
     }
+    return static_cast<size_t>(p - text.data());
+}
+
+size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out) {
+    const size_t before = out.size();
+    SmapsParser(out).feed(text);
     return out.size() - before;
 }
 

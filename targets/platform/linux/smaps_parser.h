@@ -90,6 +90,22 @@ struct SmapsRegion {
 // returns the number appended. Never fails: unparseable lines are skipped.
 size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out);
 
+// The same parse over text that arrives in pieces, so that a process with a
+// million mappings is parsed through a small buffer instead of holding its
+// whole smaps (about 700 bytes a mapping) at once. feed() parses every
+// whole line of `text` and returns how many bytes that was; the caller
+// keeps the rest and gives it again, followed by what it reads next. The
+// region being parsed is out.back() until the next header line.
+class SmapsParser {
+public:
+    explicit SmapsParser(std::vector<SmapsRegion> &out) : _out(out) {}
+    size_t feed(std::string_view text);
+
+private:
+    std::vector<SmapsRegion> &_out;
+    bool _inRegion = false;
+};
+
 // A device as one number, major above minor, as the layer keys files.
 inline uint64_t deviceNumber(uint32_t majorNumber, uint32_t minorNumber) {
     return (uint64_t{majorNumber} << 32) | minorNumber;
