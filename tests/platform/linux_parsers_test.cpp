@@ -20,7 +20,7 @@ std::string summary(const SmapsRegion &r) {
     std::ostringstream out;
     out << std::hex << r.start << '-' << r.end << " @" << r.offset << ' ' << r.devMajor << ':' << r.devMinor
         << std::dec << ' ' << r.inode << ' ' << (r.read ? 'r' : '-') << (r.write ? 'w' : '-')
-        << (r.shared ? 's' : 'p') << " '" << r.path << "' rss " << r.rss / 1024 << " pd " << r.privateDirty / 1024
+        << (r.shared ? 's' : 'p') << " '" << r.path.str() << "' rss " << r.rss / 1024 << " pd " << r.privateDirty / 1024
         << " sd " << r.sharedDirty / 1024 << " lazy " << r.lazyFree / 1024 << " swap " << r.swap / 1024 << " [";
     const std::pair<uint64_t, const char *> flags[] = {{vs::kVmRead, "rd"},     {vs::kVmWrite, "wr"},
                                                        {vs::kVmMayRead, "mr"},  {vs::kVmMayWrite, "mw"},

@@ -282,7 +282,7 @@ int64_t readMappedFile(void *context, const SmapsRegion &region, uint64_t offset
     if (n >= 0 || n == -ESRCH) {
         return n;
     }
-    const std::string rooted = "root" + region.path;
+    const std::string rooted = "root" + region.path.str();
     return readFileOfProcess(c.dirFd, rooted.c_str(), O_NOFOLLOW, device, region.inode, offset, out, size);
 }
 

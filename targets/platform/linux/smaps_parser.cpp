@@ -1,5 +1,6 @@
 #include "targets/platform/linux/smaps_parser.h"
 
+#include "model/memory_region.h"
 #include "targets/platform/linux/packed_numbers.h"
 
 #include <algorithm>
@@ -8,6 +9,13 @@
 #include <cstring>
 
 namespace vs {
+
+MappingPath::MappingPath(std::string_view text) : _text(text.empty() ? nullptr : internedString(text)) {}
+
+const std::string &MappingPath::str() const {
+    static const std::string none;
+    return _text != nullptr ? *_text : none;
+}
 
 namespace {
 
@@ -103,7 +111,7 @@ bool parseHeader(LineCursor c, SmapsRegion &r) {
     }
     // The path column is padded with blanks; the path itself keeps its own.
     c.skipBlanks();
-    r.path.assign(c.p, static_cast<size_t>(c.end - c.p));
+    r.path = MappingPath(std::string_view(c.p, static_cast<size_t>(c.end - c.p)));
     return r.end >= r.start;
 }
 
@@ -409,7 +417,7 @@ PackedSmapsRegions packSmapsRegions(const std::vector<SmapsRegion> &regions) {
             }
         }
         vs::putPackedNumber(packed.bytes, pathIndex);
-        forEachCounter(r, [&](const uint64_t &value) { vs::putPackedNumber(packed.bytes, value); });
+        forEachCounter(r, [&](const KilobyteSize &value) { vs::putPackedNumber(packed.bytes, uint64_t{value} / 1024); });
         vs::putPackedNumber(packed.bytes, r.vmFlags);
         previousEnd = r.end;
     }
@@ -440,7 +448,7 @@ void unpackSmapsRegions(const PackedSmapsRegions &packed, std::vector<SmapsRegio
         if (pathIndex != 0 && pathIndex <= packed.paths.size()) {
             r.path = packed.paths[pathIndex - 1];
         }
-        forEachCounter(r, [&](uint64_t &value) { value = vs::takePackedNumber(packed.bytes, at); });
+        forEachCounter(r, [&](KilobyteSize &value) { value = vs::takePackedNumber(packed.bytes, at) * 1024; });
         r.vmFlags = vs::takePackedNumber(packed.bytes, at);
         previousEnd = r.end;
         regions.push_back(std::move(r));
