@@ -59,11 +59,11 @@ struct VSLinuxPlatform::Task {
     std::vector<SmapsRegion> regions;
     std::vector<vs::MappingKind> kinds;
     std::vector<uint32_t> tags;
-    // The records of every region, one per part: region i's parts are
-    // parts[firstPart[i]] to parts[firstPart[i + 1]]. Built on the first
+    // The records of every region, one per part, packed: region i's parts
+    // are the bytes parts[firstPart[i]] to parts[firstPart[i + 1]]. Built on the first
     // region query, after the run's shared pages are resolved.
     bool partsBuilt = false;
-    std::vector<VSRegionInfo> parts;
+    std::vector<uint8_t> parts;
     std::vector<uint32_t> firstPart;
 
     // Prepared for the run's shared-page resolution: its pages are in the
@@ -842,7 +842,8 @@ void VSLinuxPlatform::_buildParts(Task &task) {
     vs::ObjectIdTable &ids = vs::ObjectIdTable::shared();
     task.parts.clear();
     task.firstPart.clear();
-    task.parts.reserve(task.regions.size() + task.regions.size() / 4);
+    // About 24 bytes a part, most regions one part.
+    task.parts.reserve(task.regions.size() * 24);
     task.firstPart.reserve(task.regions.size() + 1);
     const bool resolved = task.prepared && _sharedPagesResolved.load();
     UniqueFd pagemap;
@@ -900,11 +901,12 @@ void VSLinuxPlatform::_buildParts(Task &task) {
             objectPages = _sharedPages.objectPages(device, region.inode, first, region.size() / _pageSize);
         }
         task.firstPart.push_back(static_cast<uint32_t>(task.parts.size()));
-        for (VSRegionInfo &part : vs::regionPartsFor(region, kind, task.tags[i], ids, _pageSize, shared, objectPages)) {
-            task.parts.push_back(part);
+        for (const VSRegionInfo &part : vs::regionPartsFor(region, kind, task.tags[i], ids, _pageSize, shared, objectPages)) {
+            vs::packRegionInfo(part, task.parts);
         }
     }
     task.firstPart.push_back(static_cast<uint32_t>(task.parts.size()));
+    task.parts.shrink_to_fit();
     task.partsBuilt = true;
     if (!task.storedBytes.empty()) {
         _storedKeyBytes.fetch_sub(task.storedBytes.capacity());
@@ -1187,7 +1189,7 @@ void VSLinuxPlatform::_releaseParse(Task &task) {
     task.packed = vs::PackedSmapsRegions{};
     std::vector<vs::MappingKind>().swap(task.kinds);
     std::vector<uint32_t>().swap(task.tags);
-    std::vector<VSRegionInfo>().swap(task.parts);
+    std::vector<uint8_t>().swap(task.parts);
     std::vector<uint32_t>().swap(task.firstPart);
     task.partsBuilt = false;
     task.parsed = false;
@@ -1233,7 +1235,8 @@ VSReturnCode VSLinuxPlatform::region_recurse(VSTaskHandle handle, uint64_t &addr
     address = task->regions[i].start;
     size = task->regions[i].size();
     depth = 0;
-    info = task->parts[task->firstPart[i]];
+    size_t at = task->firstPart[i];
+    info = vs::unpackRegionInfo(task->parts, at);
     infoCount = vs::kRegionInfoCount;
     return 0;
 }
@@ -1255,7 +1258,9 @@ VSReturnCode VSLinuxPlatform::region_parts(VSTaskHandle handle, uint64_t address
         return vs::kReturnNoMoreRegions;
     }
     _buildParts(*task);
-    parts.assign(task->parts.begin() + task->firstPart[i], task->parts.begin() + task->firstPart[i + 1]);
+    for (size_t at = task->firstPart[i]; at < task->firstPart[i + 1];) {
+        parts.push_back(vs::unpackRegionInfo(task->parts, at));
+    }
     return 0;
 }
 
