@@ -59,6 +59,7 @@ struct VSLinuxPlatform::Task {
     std::vector<SmapsRegion> regions;
     std::vector<vs::MappingKind> kinds;
     std::vector<uint32_t> tags;
+    size_t walkHint = 0; // where the last region query found its region
     // The records of every region, one per part, packed: region i's parts
     // are the bytes parts[firstPart[i]] to parts[firstPart[i + 1]]. Built on the first
     // region query, after the run's shared pages are resolved.
@@ -291,6 +292,19 @@ size_t regionAtOrAbove(const std::vector<SmapsRegion> &regions, uint64_t address
     auto it = std::upper_bound(regions.begin(), regions.end(), address,
                                [](uint64_t a, const SmapsRegion &r) { return a < r.end; });
     return static_cast<size_t>(it - regions.begin());
+}
+
+// The same, looking first where the last answer was: the walk asks for
+// the regions in address order, each a few times (record, parts, basic
+// record), and a search of a million regions misses the cache at every step.
+size_t regionAtOrAbove(const std::vector<SmapsRegion> &regions, uint64_t address, size_t &hint) {
+    const size_t last = std::min(hint + 2, regions.size());
+    for (size_t i = hint; i < last; ++i) {
+        if (regions[i].end > address && (i == 0 || regions[i - 1].end <= address)) {
+            return hint = i;
+        }
+    }
+    return hint = regionAtOrAbove(regions, address);
 }
 
 int openProc(int32_t pid, int flags) {
@@ -1223,7 +1237,7 @@ VSReturnCode VSLinuxPlatform::region_recurse(VSTaskHandle handle, uint64_t &addr
     if (code != 0) {
         return code;
     }
-    const size_t i = regionAtOrAbove(task->regions, address);
+    const size_t i = regionAtOrAbove(task->regions, address, task->walkHint);
     if (i >= task->regions.size()) {
         // The walk has passed the last region and is done with the parse:
         // a run over every process then holds one parse per thread at a
@@ -1253,7 +1267,7 @@ VSReturnCode VSLinuxPlatform::region_parts(VSTaskHandle handle, uint64_t address
     if (code != 0) {
         return code;
     }
-    const size_t i = regionAtOrAbove(task->regions, address);
+    const size_t i = regionAtOrAbove(task->regions, address, task->walkHint);
     if (i >= task->regions.size() || task->regions[i].start > address) {
         return vs::kReturnNoMoreRegions;
     }
@@ -1280,7 +1294,7 @@ VSReturnCode VSLinuxPlatform::region_info(VSTaskHandle handle, uint64_t &address
     if (code != 0) {
         return code;
     }
-    const size_t i = regionAtOrAbove(task->regions, address);
+    const size_t i = regionAtOrAbove(task->regions, address, task->walkHint);
     if (i >= task->regions.size()) {
         return vs::kReturnNoMoreRegions;
     }
