@@ -25,7 +25,27 @@ std::uint64_t mergedSize(std::uint64_t a, std::uint64_t b, std::uint64_t overlap
     return std::max(sum - std::min(sum, overlap), std::max(a, b));
 }
 
+std::unique_ptr<VSRangeListNode> nodeFor(const VSMemoryRegion &region) {
+    auto node = std::make_unique<VSRangeListNode>();
+    node->offset = region.offset();
+    node->size = region.size();
+    node->cleanSize = region.cleanNonSpecSize();
+    node->dirtySize = region.dirtySize();
+    node->swappedSize = region.swappedSize();
+    node->reclaimableSize = region.reclaimableSize();
+    node->wiredSize = region.wiredSize();
+    return node;
+}
+
 } // namespace
+
+void VSMemoryObject::_listUnlistedRegion() const {
+    if (_unlistedRegion != nullptr) {
+        VS_ASSERT(!_rangeListHead);
+        _rangeListHead = nodeFor(*_unlistedRegion);
+        _unlistedRegion = nullptr;
+    }
+}
 
 VSMemoryObject::~VSMemoryObject() {
     // Unlink node by node: letting the unique_ptr chain destroy itself
@@ -57,14 +77,12 @@ void VSMemoryObject::addRegion(VSMemoryRegion *region, std::uint64_t pageSize) {
         return;
     }
 
-    auto node = std::make_unique<VSRangeListNode>();
-    node->offset = region->offset();
-    node->size = region->size();
-    node->cleanSize = region->cleanNonSpecSize();
-    node->dirtySize = region->dirtySize();
-    node->swappedSize = region->swappedSize();
-    node->reclaimableSize = region->reclaimableSize();
-    node->wiredSize = region->wiredSize();
+    if (!_rangeListHead && _unlistedRegion == nullptr) {
+        _unlistedRegion = region;
+        return;
+    }
+    _listUnlistedRegion();
+    std::unique_ptr<VSRangeListNode> node = nodeFor(*region);
 
     if (!_rangeListHead) {
         _rangeListHead = std::move(node);
@@ -125,6 +143,13 @@ void VSMemoryObject::calculateSizes() {
     _totalReclaimableSize = 0;
     _totalSwappedSize = 0;
     _totalWiredSize = 0;
+    if (_unlistedRegion != nullptr) {
+        _totalDirtySize = _unlistedRegion->dirtySize();
+        _totalCleanSize = _unlistedRegion->cleanNonSpecSize();
+        _totalReclaimableSize = _unlistedRegion->reclaimableSize();
+        _totalSwappedSize = _unlistedRegion->swappedSize();
+        _totalWiredSize = _unlistedRegion->wiredSize();
+    }
     for (const VSRangeListNode *node = _rangeListHead.get(); node; node = node->next.get()) {
         _totalDirtySize += node->dirtySize;
         _totalCleanSize += node->cleanSize;

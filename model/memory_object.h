@@ -13,7 +13,9 @@
 // is an upper bound on what the two can have in common.
 //
 // The object refers to its regions without owning them (their target owns
-// them); the regions must outlive the object's use.
+// them); the regions must outlive the object's use and keep their offset,
+// size and page-class sizes once added (the first one is read when the
+// object is sized).
 
 #include <cstdint>
 #include <memory>
@@ -85,7 +87,11 @@ public:
     void setMemoryRegions(vs::RegionSet regions) { _memoryRegions = std::move(regions); }
 
     // The range list, for inspection (tests, debugging): first node or null.
-    const VSRangeListNode *rangeListHead() const { return _rangeListHead.get(); }
+    // Not for use while another thread reads the object.
+    const VSRangeListNode *rangeListHead() const {
+        _listUnlistedRegion();
+        return _rangeListHead.get();
+    }
 
 private:
     vs::RegionSet _memoryRegions;
@@ -95,6 +101,13 @@ private:
     std::uint64_t _totalSwappedSize = 0;
     std::uint64_t _totalWiredSize = 0;
     const std::string *_name = nullptr;
-    std::unique_ptr<VSRangeListNode> _rangeListHead;
+    // Makes the unlisted region's node, if there is one.
+    void _listUnlistedRegion() const;
+
+    mutable std::unique_ptr<VSRangeListNode> _rangeListHead;
+    // Most objects only ever have one region, whose range needs no merging:
+    // its node is only made when a second one comes, and until then the
+    // sizes are the region's own.
+    mutable VSMemoryRegion *_unlistedRegion = nullptr;
     bool _accurateSizes = false;
 };

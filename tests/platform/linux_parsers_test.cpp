@@ -1,9 +1,11 @@
 // The text parsers of the Linux layer on small raw samples.
 
+#include "targets/platform/linux/proc_reader.h"
 #include "targets/platform/linux/proc_text.h"
 #include "targets/platform/linux/smaps_parser.h"
 
 #include <gtest/gtest.h>
+#include <cstdio>
 #include <tuple>
 #include <sstream>
 #include <string>
@@ -18,7 +20,7 @@ std::string summary(const SmapsRegion &r) {
     std::ostringstream out;
     out << std::hex << r.start << '-' << r.end << " @" << r.offset << ' ' << r.devMajor << ':' << r.devMinor
         << std::dec << ' ' << r.inode << ' ' << (r.read ? 'r' : '-') << (r.write ? 'w' : '-')
-        << (r.shared ? 's' : 'p') << " '" << r.path << "' rss " << r.rss / 1024 << " pd " << r.privateDirty / 1024
+        << (r.shared ? 's' : 'p') << " '" << r.path.str() << "' rss " << r.rss / 1024 << " pd " << r.privateDirty / 1024
         << " sd " << r.sharedDirty / 1024 << " lazy " << r.lazyFree / 1024 << " swap " << r.swap / 1024 << " [";
     const std::pair<uint64_t, const char *> flags[] = {{vs::kVmRead, "rd"},     {vs::kVmWrite, "wr"},
                                                        {vs::kVmMayRead, "mr"},  {vs::kVmMayWrite, "mw"},
@@ -187,6 +189,51 @@ TEST(LinuxProcText, PackedRegionsComeBackExactly) {
     }
     // Each path once, whatever number of mappings show it.
     EXPECT_EQ(vs::packSmapsRegions(regions).paths.size(), 3u);
+}
+
+// smaps read in pieces through a buffer that does not hold the file parses
+// as the whole text does, wherever the reads cut it: inside a number, a
+// header, a path longer than the buffer, or right at the end of a line.
+TEST(LinuxProcText, SmapsReadInPiecesParsesAsTheWhole) {
+    std::string text;
+    for (int i = 0; i < 2000; ++i) {
+        char header[96];
+        std::snprintf(header, sizeof header, "%x000-%x000 rw-p %08x fe:00 %d ", 0x10000 + 2 * i, 0x10001 + 2 * i,
+                      i * 4096, i % 3 == 0 ? 0 : 100 + i % 5);
+        text += header;
+        // One path much longer than the reader's buffer.
+        text += i % 3 == 0 ? "" : i == 77 ? "/" + std::string(40000, 'x') : "/lib/piece" + std::to_string(i % 5);
+        text += "\nSize: 4 kB\nRss: " + std::to_string(i % 7) + " kB\nPrivate_Dirty: " + std::to_string(i % 5) +
+                " kB\nSwap: " + std::to_string(i) + " kB\nVmFlags: rd wr mr mw me ac\n";
+    }
+    text += "ffffffffff600000-ffffffffff601000 --xp 00000000 00:00 0 [vsyscall]\nRss: 12"; // cut short
+    std::vector<SmapsRegion> whole;
+    ASSERT_EQ(vs::parseSmaps(text, whole), 2001u);
+    ASSERT_GT(text.size(), size_t{128 * 1024});
+
+    std::FILE *file = std::tmpfile();
+    ASSERT_NE(file, nullptr);
+    ASSERT_EQ(std::fwrite(text.data(), 1, text.size(), file), text.size());
+    ASSERT_EQ(std::fflush(file), 0);
+    for (const size_t chunk : {size_t{1}, size_t{27}, size_t{3072}, SIZE_MAX}) {
+        std::vector<SmapsRegion> pieces;
+        vs::SmapsParser parser(pieces);
+        uint64_t total = 0;
+        size_t largest = 0;
+        const int error = vs::readInPieces(fileno(file), chunk, [&](std::string_view piece) {
+            largest = std::max(largest, piece.size());
+            return parser.feed(piece);
+        }, total);
+        ASSERT_EQ(error, 0) << chunk;
+        EXPECT_EQ(total, text.size()) << chunk;
+        // Never more than the longest line and one read at a time.
+        EXPECT_LE(largest, size_t{64 * 1024}) << chunk;
+        ASSERT_EQ(pieces.size(), whole.size()) << chunk;
+        for (size_t i = 0; i < whole.size(); ++i) {
+            EXPECT_EQ(summary(pieces[i]), summary(whole[i])) << chunk << " mapping " << i;
+        }
+    }
+    std::fclose(file);
 }
 
 } // namespace

@@ -120,6 +120,20 @@ TEST(LinuxRegionRecords, NamedAnonymousMemoryGetsItsOwnTag) {
     }
 }
 
+// Part records wait for the walk packed; they must come back byte for byte.
+void expectPackedComeBack(const std::vector<VSRegionInfo> &records) {
+    std::vector<uint8_t> packed;
+    for (const VSRegionInfo &record : records) {
+        vs::packRegionInfo(record, packed);
+    }
+    size_t at = 0;
+    for (size_t i = 0; i < records.size(); ++i) {
+        const VSRegionInfo back = vs::unpackRegionInfo(packed, at);
+        EXPECT_EQ(std::memcmp(&back, &records[i], sizeof back), 0) << "record " << i;
+    }
+    EXPECT_EQ(at, packed.size());
+}
+
 TEST(LinuxRegionRecords, PartsOfOneMappingEachInOneObject) {
     // What a part is: which object (by what it stands for), where in it,
     // and its pages.
@@ -199,7 +213,17 @@ TEST(LinuxRegionRecords, PartsOfOneMappingEachInOneObject) {
         }
         std::sort(objects.begin(), objects.end());
         EXPECT_EQ(std::adjacent_find(objects.begin(), objects.end()), objects.end()) << "one object per part";
+        expectPackedComeBack(parts);
     }
+    // Every field at its widest, the signed ones negative.
+    VSRegionInfo widest;
+    std::memset(static_cast<void *>(&widest), 0xFF, sizeof widest);
+    VSRegionInfo mixed;
+    mixed.protection = -2;
+    mixed.offset = 0x7FFFFFFFF000ull;
+    mixed.objectId = 1u << 31;
+    mixed.shadowDepth = 0x8000;
+    expectPackedComeBack({widest, mixed, VSRegionInfo{}});
 }
 
 TEST(LinuxObjectIds, WhatMakesTwoMappingsOneObject) {

@@ -259,7 +259,7 @@ std::vector<ProcessImage> processImages(const std::vector<SmapsRegion> &regions,
         if (!bias) {
             continue;
         }
-        ProcessImage image{region.path, imageSegments(*info, *bias, pageSize)};
+        ProcessImage image{region.path.str(), imageSegments(*info, *bias, pageSize)};
         if (image.segments.empty()) {
             continue;
         }

@@ -60,11 +60,12 @@ struct VSLinuxPlatform::Task {
     std::vector<SmapsRegion> regions;
     std::vector<vs::MappingKind> kinds;
     std::vector<uint32_t> tags;
-    // The records of every region, one per part: region i's parts are
-    // parts[firstPart[i]] to parts[firstPart[i + 1]]. Built on the first
+    size_t walkHint = 0; // where the last region query found its region
+    // The records of every region, one per part, packed: region i's parts
+    // are the bytes parts[firstPart[i]] to parts[firstPart[i + 1]]. Built on the first
     // region query, after the run's shared pages are resolved.
     bool partsBuilt = false;
-    std::vector<VSRegionInfo> parts;
+    std::vector<uint8_t> parts;
     std::vector<uint32_t> firstPart;
 
     // Prepared for the run's shared-page resolution: its pages are in the
@@ -283,7 +284,7 @@ int64_t readMappedFile(void *context, const SmapsRegion &region, uint64_t offset
     if (n >= 0 || n == -ESRCH) {
         return n;
     }
-    const std::string rooted = "root" + region.path;
+    const std::string rooted = "root" + region.path.str();
     return readFileOfProcess(c.dirFd, rooted.c_str(), O_NOFOLLOW, device, region.inode, offset, out, size);
 }
 
@@ -292,6 +293,19 @@ size_t regionAtOrAbove(const std::vector<SmapsRegion> &regions, uint64_t address
     auto it = std::upper_bound(regions.begin(), regions.end(), address,
                                [](uint64_t a, const SmapsRegion &r) { return a < r.end; });
     return static_cast<size_t>(it - regions.begin());
+}
+
+// The same, looking first where the last answer was: the walk asks for
+// the regions in address order, each a few times (record, parts, basic
+// record), and a search of a million regions misses the cache at every step.
+size_t regionAtOrAbove(const std::vector<SmapsRegion> &regions, uint64_t address, size_t &hint) {
+    const size_t last = std::min(hint + 2, regions.size());
+    for (size_t i = hint; i < last; ++i) {
+        if (regions[i].end > address && (i == 0 || regions[i - 1].end <= address)) {
+            return hint = i;
+        }
+    }
+    return hint = regionAtOrAbove(regions, address);
 }
 
 int openProc(int32_t pid, int flags) {
@@ -798,28 +812,29 @@ const std::unordered_map<uint64_t, bool> &VSLinuxPlatform::_openableDevices() {
 }
 
 VSReturnCode VSLinuxPlatform::_parse(Task &task) {
-    ReadBuffer &buffer = vs::threadReadBuffer();
-    std::string_view text;
+    // Parsed as it is read: the text of a process with many mappings is
+    // never held whole.
+    vs::SmapsParser parser(task.regions);
+    const auto consume = [&parser](std::string_view text) { return parser.feed(text); };
+    uint64_t bytes = 0;
     int error = 0;
     if (task.smaps.valid()) {
-        error = vs::readAll(task.smaps.get(), buffer, text, vs::kRecordFileChunk);
+        error = vs::readInPieces(task.smaps.get(), vs::kRecordFileChunk, consume, bytes);
         // Opened before an exec, the file shows the address space the
         // process has left: empty. Its new one needs a new open.
-        if (error == 0 && text.empty()) {
+        if (error == 0 && bytes == 0) {
             task.smaps = UniqueFd();
         }
     }
     if (!task.smaps.valid()) {
         task.smaps = UniqueFd(::openat(task.dir.get(), "smaps", O_RDONLY | O_CLOEXEC));
-        error = task.smaps.valid() ? vs::readAll(task.smaps.get(), buffer, text, vs::kRecordFileChunk) : errno;
+        error = task.smaps.valid() ? vs::readInPieces(task.smaps.get(), vs::kRecordFileChunk, consume, bytes) : errno;
     }
     task.smaps = UniqueFd(); // a parse asked for again reads anew
     if (error != 0) {
+        std::vector<SmapsRegion>().swap(task.regions);
         return (error == ESRCH || error == ENOENT) ? vs::kReturnDeadPort : regionErrno(error);
     }
-    // About 700 bytes of text per mapping; a close guess saves regrowing.
-    task.regions.reserve(text.size() / 640 + 1);
-    vs::parseSmaps(text, task.regions);
     if (task.regions.empty() && processHasGone(task.dir.get())) {
         return vs::kReturnDeadPort;
     }
@@ -842,7 +857,8 @@ void VSLinuxPlatform::_buildParts(Task &task) {
     vs::ObjectIdTable &ids = vs::ObjectIdTable::shared();
     task.parts.clear();
     task.firstPart.clear();
-    task.parts.reserve(task.regions.size() + task.regions.size() / 4);
+    // About 24 bytes a part, most regions one part.
+    task.parts.reserve(task.regions.size() * 24);
     task.firstPart.reserve(task.regions.size() + 1);
     const bool resolved = task.prepared && _sharedPagesResolved.load();
     UniqueFd pagemap;
@@ -890,11 +906,12 @@ void VSLinuxPlatform::_buildParts(Task &task) {
                                                    region.offset / _pageSize, region.size() / _pageSize);
         }
         task.firstPart.push_back(static_cast<uint32_t>(task.parts.size()));
-        for (VSRegionInfo &part : vs::regionPartsFor(region, kind, task.tags[i], ids, _pageSize, shared, objectPages)) {
-            task.parts.push_back(part);
+        for (const VSRegionInfo &part : vs::regionPartsFor(region, kind, task.tags[i], ids, _pageSize, shared, objectPages)) {
+            vs::packRegionInfo(part, task.parts);
         }
     }
     task.firstPart.push_back(static_cast<uint32_t>(task.parts.size()));
+    task.parts.shrink_to_fit();
     task.partsBuilt = true;
     if (!task.storedBytes.empty()) {
         _storedKeyBytes.fetch_sub(task.storedBytes.capacity());
@@ -1236,7 +1253,7 @@ void VSLinuxPlatform::_releaseParse(Task &task) {
     task.packed = vs::PackedSmapsRegions{};
     std::vector<vs::MappingKind>().swap(task.kinds);
     std::vector<uint32_t>().swap(task.tags);
-    std::vector<VSRegionInfo>().swap(task.parts);
+    std::vector<uint8_t>().swap(task.parts);
     std::vector<uint32_t>().swap(task.firstPart);
     task.partsBuilt = false;
     task.parsed = false;
@@ -1270,7 +1287,7 @@ VSReturnCode VSLinuxPlatform::region_recurse(VSTaskHandle handle, uint64_t &addr
     if (code != 0) {
         return code;
     }
-    const size_t i = regionAtOrAbove(task->regions, address);
+    const size_t i = regionAtOrAbove(task->regions, address, task->walkHint);
     if (i >= task->regions.size()) {
         // The walk has passed the last region and is done with the parse:
         // a run over every process then holds one parse per thread at a
@@ -1282,7 +1299,8 @@ VSReturnCode VSLinuxPlatform::region_recurse(VSTaskHandle handle, uint64_t &addr
     address = task->regions[i].start;
     size = task->regions[i].size();
     depth = 0;
-    info = task->parts[task->firstPart[i]];
+    size_t at = task->firstPart[i];
+    info = vs::unpackRegionInfo(task->parts, at);
     infoCount = vs::kRegionInfoCount;
     return 0;
 }
@@ -1299,12 +1317,14 @@ VSReturnCode VSLinuxPlatform::region_parts(VSTaskHandle handle, uint64_t address
     if (code != 0) {
         return code;
     }
-    const size_t i = regionAtOrAbove(task->regions, address);
+    const size_t i = regionAtOrAbove(task->regions, address, task->walkHint);
     if (i >= task->regions.size() || task->regions[i].start > address) {
         return vs::kReturnNoMoreRegions;
     }
     _buildParts(*task);
-    parts.assign(task->parts.begin() + task->firstPart[i], task->parts.begin() + task->firstPart[i + 1]);
+    for (size_t at = task->firstPart[i]; at < task->firstPart[i + 1];) {
+        parts.push_back(vs::unpackRegionInfo(task->parts, at));
+    }
     return 0;
 }
 
@@ -1324,7 +1344,7 @@ VSReturnCode VSLinuxPlatform::region_info(VSTaskHandle handle, uint64_t &address
     if (code != 0) {
         return code;
     }
-    const size_t i = regionAtOrAbove(task->regions, address);
+    const size_t i = regionAtOrAbove(task->regions, address, task->walkHint);
     if (i >= task->regions.size()) {
         return vs::kReturnNoMoreRegions;
     }

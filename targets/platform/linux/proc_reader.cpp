@@ -8,6 +8,7 @@
 #include <sys/mman.h>
 #include <unistd.h>
 #include <utility>
+#include <vector>
 
 namespace vs {
 
@@ -15,6 +16,10 @@ namespace {
 
 // Large enough for the smaps of most processes in one or two reads.
 constexpr size_t kInitialBuffer = 256 * 1024;
+
+// Room for a read of a record file and the line it may cut (a smaps
+// header line is at most a path of 4096 bytes and a hundred more).
+constexpr size_t kPieceBuffer = 16 * 1024;
 
 } // namespace
 
@@ -103,6 +108,34 @@ int readOpened(int dirFd, const char *name, ReadBuffer &buffer, std::string_view
 
 int readAll(int fd, ReadBuffer &buffer, std::string_view &text, size_t chunk) {
     return readFrom(fd, buffer, text, chunk, false);
+}
+
+int readInPieces(int fd, size_t chunk, const std::function<size_t(std::string_view)> &consume, uint64_t &total) {
+    // Holds what is not taken yet (a line still arriving) plus one read.
+    thread_local std::vector<char> buffer(kPieceBuffer);
+    size_t kept = 0;
+    total = 0;
+    for (;;) {
+        if (kept == buffer.size()) {
+            buffer.resize(buffer.size() * 2); // a line longer than the buffer
+        }
+        const size_t asked = std::min(chunk, buffer.size() - kept);
+        const ssize_t n = ::pread(fd, buffer.data() + kept, asked, static_cast<off_t>(total));
+        if (n < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            return errno;
+        }
+        if (n == 0) {
+            return 0;
+        }
+        total += static_cast<uint64_t>(n);
+        const size_t have = kept + static_cast<size_t>(n);
+        const size_t taken = std::min(consume(std::string_view(buffer.data(), have)), have);
+        kept = have - taken;
+        std::memmove(buffer.data(), buffer.data() + taken, kept);
+    }
 }
 
 int readFileAt(int dirFd, const char *name, ReadBuffer &buffer, std::string_view &text) {

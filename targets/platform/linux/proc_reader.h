@@ -10,6 +10,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <string_view>
 
@@ -45,6 +46,14 @@ ReadBuffer &threadReadBuffer();
 // bytes per read. On success returns 0 and sets `text`; otherwise returns
 // the errno.
 int readAll(int fd, ReadBuffer &buffer, std::string_view &text, size_t chunk = SIZE_MAX);
+
+// Reads all of an open fd from offset 0, `chunk` bytes per read, through a
+// buffer of the calling thread that does not grow with the file: after each
+// read `consume` gets the text it has not taken yet (what it left last
+// time, then the new bytes) and returns how many bytes it took from the
+// front; the rest is given again with the next read. Returns 0 or the
+// errno, and sets `total` to the bytes read.
+int readInPieces(int fd, size_t chunk, const std::function<size_t(std::string_view)> &consume, uint64_t &total);
 
 // The read size for files the kernel writes record by record, one page of
 // records per read (smaps). A record that no longer fits into that page is

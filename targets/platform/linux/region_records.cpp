@@ -2,10 +2,14 @@
 
 #include "model/memory_region.h"
 #include "targets/platform/linux/object_ids.h"
+#include "targets/platform/linux/packed_numbers.h"
 
 #include <algorithm>
 #include <string>
 #include <string_view>
+#include <tuple>
+#include <type_traits>
+#include <utility>
 
 namespace vs {
 
@@ -278,6 +282,46 @@ VSRegionBasicInfo basicInfoFor(const SmapsRegion &region, MappingKind kind, uint
         basic.userWiredCount = static_cast<uint16_t>(std::min<uint64_t>(region.rss / pageSize, 0xFFFF));
     }
     return basic;
+}
+
+namespace {
+
+// The fields of a record, in packing order. Members, not references: the
+// record is packed and its 64-bit offset is not naturally aligned.
+constexpr auto kRecordFields = std::make_tuple(
+        &VSRegionInfo::protection, &VSRegionInfo::maxProtection, &VSRegionInfo::inheritance, &VSRegionInfo::offset,
+        &VSRegionInfo::userTag, &VSRegionInfo::residentPages, &VSRegionInfo::sharedNowPrivatePages,
+        &VSRegionInfo::swappedOutPages, &VSRegionInfo::dirtiedPages, &VSRegionInfo::referenceCount,
+        &VSRegionInfo::shadowDepth, &VSRegionInfo::externalPager, &VSRegionInfo::shareMode, &VSRegionInfo::isSubmap,
+        &VSRegionInfo::behaviour, &VSRegionInfo::objectId, &VSRegionInfo::userWiredCount, &VSRegionInfo::_padding,
+        &VSRegionInfo::reusablePages);
+
+template <class Visit>
+void forEachRecordField(Visit visit) {
+    std::apply([&](auto... member) { (visit(member), ...); }, kRecordFields);
+}
+
+// A field's type, and the unsigned number of its width that packs it (the
+// signed fields come back through the same cast).
+template <class Member>
+using FieldOf = std::remove_cvref_t<decltype(std::declval<VSRegionInfo &>().*std::declval<Member>())>;
+
+} // namespace
+
+void packRegionInfo(const VSRegionInfo &info, std::vector<uint8_t> &out) {
+    forEachRecordField([&](auto member) {
+        using Field = FieldOf<decltype(member)>;
+        putPackedNumber(out, static_cast<std::make_unsigned_t<Field>>(info.*member));
+    });
+}
+
+VSRegionInfo unpackRegionInfo(std::span<const uint8_t> bytes, size_t &at) {
+    VSRegionInfo info;
+    forEachRecordField([&](auto member) {
+        using Field = FieldOf<decltype(member)>;
+        info.*member = static_cast<Field>(static_cast<std::make_unsigned_t<Field>>(takePackedNumber(bytes, at)));
+    });
+    return info;
 }
 
 } // namespace vs

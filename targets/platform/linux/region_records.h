@@ -11,6 +11,7 @@
 
 #include <cstdint>
 #include <optional>
+#include <span>
 #include <vector>
 
 namespace vs {
@@ -54,5 +55,12 @@ std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind 
 
 // The top-level record of the same mapping.
 VSRegionBasicInfo basicInfoFor(const SmapsRegion &region, MappingKind kind, uint64_t pageSize);
+
+// Part records wait for the walk packed (variable-length numbers): a
+// record is 68 bytes and a process may have a million, nearly every field
+// of which is a small number. unpackRegionInfo gives back exactly what was
+// packed and moves `at` past it.
+void packRegionInfo(const VSRegionInfo &info, std::vector<uint8_t> &out);
+VSRegionInfo unpackRegionInfo(std::span<const uint8_t> bytes, size_t &at);
 
 } // namespace vs

@@ -1,5 +1,6 @@
 #include "targets/platform/linux/smaps_parser.h"
 
+#include "model/memory_region.h"
 #include "targets/platform/linux/packed_numbers.h"
 
 #include <algorithm>
@@ -8,6 +9,13 @@
 #include <cstring>
 
 namespace vs {
+
+MappingPath::MappingPath(std::string_view text) : _text(text.empty() ? nullptr : internedString(text)) {}
+
+const std::string &MappingPath::str() const {
+    static const std::string none;
+    return _text != nullptr ? *_text : none;
+}
 
 namespace {
 
@@ -103,7 +111,7 @@ bool parseHeader(LineCursor c, SmapsRegion &r) {
     }
     // The path column is padded with blanks; the path itself keeps its own.
     c.skipBlanks();
-    r.path.assign(c.p, static_cast<size_t>(c.end - c.p));
+    r.path = MappingPath(std::string_view(c.p, static_cast<size_t>(c.end - c.p)));
     return r.end >= r.start;
 }
 
@@ -295,15 +303,13 @@ const char *findNewline(const char *p, const char *end) {
 
 } // namespace
 
-size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out) {
-    const size_t before = out.size();
-    bool inRegion = false;
+size_t SmapsParser::feed(std::string_view text) {
     const char *p = text.data();
     const char *const end = p + text.size();
     while (p < end) {
         const char *newline = findNewline(p, end);
         if (newline == nullptr) {
-            break; // cut short: the last line is incomplete
+            break; // the rest of the line has not arrived (or never will)
         }
         const char *line = p;
         p = newline + 1;
@@ -312,15 +318,21 @@ size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out) {
         }
         const char first = *line;
         if ((first >= '0' && first <= '9') || (first >= 'a' && first <= 'f')) {
-            SmapsRegion &region = out.emplace_back();
-            inRegion = parseHeader(LineCursor{line, newline}, region);
-            if (!inRegion) {
-                out.pop_back();
+            SmapsRegion &region = _out.emplace_back();
+            _inRegion = parseHeader(LineCursor{line, newline}, region);
+            if (!_inRegion) {
+                _out.pop_back();
             }
-        } else if (inRegion && first >= 'A' && first <= 'Z') {
-            parseField(line, newline, out.back());
+        } else if (_inRegion && first >= 'A' && first <= 'Z') {
+            parseField(line, newline, _out.back());
         }
     }
+    return static_cast<size_t>(p - text.data());
+}
+
+size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out) {
+    const size_t before = out.size();
+    SmapsParser(out).feed(text);
     return out.size() - before;
 }
 
@@ -405,7 +417,7 @@ PackedSmapsRegions packSmapsRegions(const std::vector<SmapsRegion> &regions) {
             }
         }
         vs::putPackedNumber(packed.bytes, pathIndex);
-        forEachCounter(r, [&](const uint64_t &value) { vs::putPackedNumber(packed.bytes, value); });
+        forEachCounter(r, [&](const KilobyteSize &value) { vs::putPackedNumber(packed.bytes, uint64_t{value} / 1024); });
         vs::putPackedNumber(packed.bytes, r.vmFlags);
         previousEnd = r.end;
     }
@@ -436,7 +448,7 @@ void unpackSmapsRegions(const PackedSmapsRegions &packed, std::vector<SmapsRegio
         if (pathIndex != 0 && pathIndex <= packed.paths.size()) {
             r.path = packed.paths[pathIndex - 1];
         }
-        forEachCounter(r, [&](uint64_t &value) { value = vs::takePackedNumber(packed.bytes, at); });
+        forEachCounter(r, [&](KilobyteSize &value) { value = vs::takePackedNumber(packed.bytes, at) * 1024; });
         r.vmFlags = vs::takePackedNumber(packed.bytes, at);
         previousEnd = r.end;
         regions.push_back(std::move(r));

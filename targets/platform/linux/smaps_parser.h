@@ -53,42 +53,96 @@ inline constexpr uint64_t kVmSoftDirty = 1ull << 25; // sd
 // Bit of a two-letter VmFlags name, 0 for names this program ignores.
 uint64_t vmFlagBit(char first, char second);
 
-// One mapping. Sizes are in bytes (the file prints kB).
+// A size the kernel prints in kB, kept as that count and read as bytes. A
+// process may have a million mappings, each with a dozen sizes: 32 bits of
+// kB (4 TiB) hold any one mapping's, in half the room of a byte count.
+class KilobyteSize {
+public:
+    constexpr KilobyteSize() = default;
+    // Bytes below a whole kB are dropped; beyond 4 TiB the count saturates.
+    constexpr KilobyteSize(uint64_t bytes)
+        : _kilobytes(bytes / 1024 > UINT32_MAX ? UINT32_MAX : static_cast<uint32_t>(bytes / 1024)) {}
+    constexpr operator uint64_t() const { return uint64_t{_kilobytes} * 1024; }
+
+private:
+    uint32_t _kilobytes = 0;
+};
+
+// A mapping's path, held once for the whole run however many mappings
+// (of however many processes) show it: a pointer to the run-wide copy,
+// null for none. Reads as a string_view.
+class MappingPath {
+public:
+    MappingPath() = default;
+    MappingPath(std::string_view text);
+    MappingPath(const char *text) : MappingPath(std::string_view(text)) {}
+    MappingPath(const std::string &text) : MappingPath(std::string_view(text)) {}
+
+    operator std::string_view() const { return _text != nullptr ? std::string_view(*_text) : std::string_view(); }
+    const std::string &str() const;
+    bool empty() const { return _text == nullptr; }
+    size_t size() const { return _text != nullptr ? _text->size() : 0; }
+    char operator[](size_t i) const { return (*_text)[i]; }
+    friend bool operator==(const MappingPath &a, std::string_view b) { return std::string_view(a) == b; }
+
+private:
+    const std::string *_text = nullptr;
+};
+
+// One mapping. Sizes read as bytes (the file prints kB). Kept small: a parse
+// holds one per mapping until the walk has passed the last one.
 struct SmapsRegion {
     uint64_t start = 0;
     uint64_t end = 0;
     uint64_t offset = 0;
     uint64_t inode = 0;
+    uint64_t vmFlags = 0;
     uint32_t devMajor = 0;
     uint32_t devMinor = 0;
+    MappingPath path; // as printed, empty for plain anonymous memory
+
+    KilobyteSize rss;
+    KilobyteSize sharedClean;
+    KilobyteSize sharedDirty;
+    KilobyteSize privateClean;
+    KilobyteSize privateDirty;
+    KilobyteSize lazyFree;
+    KilobyteSize anonymous; // anonymous pages, copy-on-write copies of file pages included
+    KilobyteSize swap;
+    KilobyteSize swapPss;   // below swap when some swap entries are shared
+    KilobyteSize privateHugetlb; // hugetlb pages, which Rss leaves out
+    KilobyteSize sharedHugetlb;
+    KilobyteSize locked;
     bool read = false;
     bool write = false;
     bool exec = false;
     bool shared = false; // 's' in the perms, else 'p'
-    std::string path;    // as printed, empty for plain anonymous memory
-
-    uint64_t rss = 0;
-    uint64_t sharedClean = 0;
-    uint64_t sharedDirty = 0;
-    uint64_t privateClean = 0;
-    uint64_t privateDirty = 0;
-    uint64_t lazyFree = 0;
-    uint64_t anonymous = 0; // anonymous pages, copy-on-write copies of file pages included
-    uint64_t swap = 0;
-    uint64_t swapPss = 0;   // below swap when some swap entries are shared
-    uint64_t privateHugetlb = 0; // hugetlb pages, which Rss leaves out
-    uint64_t sharedHugetlb = 0;
-    uint64_t locked = 0;
-    uint64_t vmFlags = 0;
     bool hasVmFlags = false; // false for maps lines and cut-short records
 
     uint64_t size() const { return end - start; }
     bool hasFlag(uint64_t bit) const { return (vmFlags & bit) != 0; }
 };
+static_assert(sizeof(SmapsRegion) <= 112);
 
 // Appends every mapping of `text` to `out` (which is not cleared) and
 // returns the number appended. Never fails: unparseable lines are skipped.
 size_t parseSmaps(std::string_view text, std::vector<SmapsRegion> &out);
+
+// The same parse over text that arrives in pieces, so that a process with a
+// million mappings is parsed through a small buffer instead of holding its
+// whole smaps (about 700 bytes a mapping) at once. feed() parses every
+// whole line of `text` and returns how many bytes that was; the caller
+// keeps the rest and gives it again, followed by what it reads next. The
+// region being parsed is out.back() until the next header line.
+class SmapsParser {
+public:
+    explicit SmapsParser(std::vector<SmapsRegion> &out) : _out(out) {}
+    size_t feed(std::string_view text);
+
+private:
+    std::vector<SmapsRegion> &_out;
+    bool _inRegion = false;
+};
 
 // A device as one number, major above minor, as the layer keys files.
 inline uint64_t deviceNumber(uint32_t majorNumber, uint32_t minorNumber) {
@@ -102,7 +156,7 @@ inline uint64_t deviceNumber(uint32_t majorNumber, uint32_t minorNumber) {
 inline constexpr uint64_t kSysVSegmentDevice = 1ull << 63;
 inline uint64_t objectDevice(const SmapsRegion &region) {
     const uint64_t device = deviceNumber(region.devMajor, region.devMinor);
-    return region.path.starts_with("/SYSV") && region.inode != 0 ? device | kSysVSegmentDevice : device;
+    return std::string_view(region.path).starts_with("/SYSV") && region.inode != 0 ? device | kSysVSegmentDevice : device;
 }
 
 // Parsed regions kept small while they wait (a run holds every target's
@@ -111,7 +165,7 @@ inline uint64_t objectDevice(const SmapsRegion &region) {
 // packed.
 struct PackedSmapsRegions {
     std::vector<uint8_t> bytes;
-    std::vector<std::string> paths;
+    std::vector<MappingPath> paths;
     size_t count = 0;
 };
 PackedSmapsRegions packSmapsRegions(const std::vector<SmapsRegion> &regions);
