@@ -7,6 +7,7 @@
 #include <fcntl.h>
 #include <grp.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -34,6 +35,7 @@ struct RunSettings {
     bool closeOutputs = false, closeInput = false;
     uid_t user = 0;  // run as this user (and its own group) when not 0
     std::string standardOutput = "";  // a file to write standard output to, instead of the result
+    std::optional<rlim_t> fileLimit = std::nullopt;  // RLIMIT_NOFILE, soft and hard
 };
 
 // Drops to an unprivileged user for the rest of a forked child's life.
@@ -75,6 +77,10 @@ inline RunResult runProgram(const std::vector<std::string> &args, const RunSetti
         } else if (s.descriptor3) {
             // dup2 onto itself would keep close-on-exec.
             *s.descriptor3 == 3 ? fcntl(3, F_SETFD, 0) : dup2(*s.descriptor3, 3);
+        }
+        if (s.fileLimit) {
+            const rlimit files{*s.fileLimit, *s.fileLimit};
+            if (setrlimit(RLIMIT_NOFILE, &files) != 0) _exit(126);
         }
         signal(SIGINT, SIG_DFL);
         if (!s.blockInterrupt) sigemptyset(&interrupt);
