@@ -229,6 +229,25 @@ TEST(LiveRun, MoreTargetsThanTheFileLimitAllows) {
     EXPECT_TRUE(missing.empty()) << missing.size() << " of " << pids.size() << " not reported, e.g. " << missing[0];
 }
 
+// The program never reads itself, neither among all processes nor when
+// its own name is asked for.
+TEST(LiveRun, TheProgramLeavesItselfOut) {
+    if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
+    const std::string thisTest = "[" + std::to_string(getpid()) + "]: ";
+    const std::pair<std::vector<std::string>, bool> cases[] = {{{"-a"}, true}, {{"-p", "vestage"}, false}};
+    for (const auto &[args, listsThisTest] : cases) {
+        SCOPED_TRACE(args.back());
+        const auto run = runProgram(args);
+        const std::string self = "[" + std::to_string(run.pid) + "]";
+        EXPECT_EQ(run.out.find(self), std::string::npos)
+            << self << " in:\n" << run.out.substr(0, run.out.find(self) + 200);
+        EXPECT_EQ(run.err.find(self), std::string::npos) << run.err;
+        if (listsThisTest) {
+            EXPECT_NE(run.out.find(thisTest), std::string::npos) << "other processes are read";
+        }
+    }
+}
+
 // Started with SIGINT ignored, as a background job of a script is: once
 // gathering is over an interrupt ends the program again.
 TEST(LiveRun, InterruptEndsThePrintingEvenWhenStartedIgnored) {

@@ -456,6 +456,43 @@ TEST_F(LinuxProcessTest, SharedLibrarySegments) {
     EXPECT_NE(segmentWhere([](const auto &s) { return s.name == "__DATA"; }), libc->segments.end());
 }
 
+// The process-wide counters against the child's own status. Its page
+// tables are memory it costs: in its physical vestage and as kernel memory
+// of its own. One page written per 2 MiB makes them weigh.
+TEST_F(LinuxProcessTest, ProcessWideCountersIncludeThePageTables) {
+    MemChild child({"tables:t:1", "shared:s:16"});
+    ASSERT_TRUE(child.ready());
+    std::string status;
+    {
+        char buffer[4096];
+        const int fd = open(("/proc/" + std::to_string(child.pid()) + "/status").c_str(), O_RDONLY | O_CLOEXEC);
+        for (ssize_t n; fd >= 0 && (n = read(fd, buffer, sizeof buffer)) > 0;) status.append(buffer, n);
+        close(fd);
+    }
+    auto kilobytes = [&](const std::string &name) {
+        const size_t at = status.find("\n" + name + ":");
+        EXPECT_NE(at, std::string::npos) << name;
+        return at == std::string::npos ? 0 : std::strtoull(status.c_str() + at + name.size() + 2, nullptr, 10) * 1024;
+    };
+    const uint64_t pageTables = kilobytes("VmPTE");
+    ASSERT_GE(pageTables, 512 * kPage) << "a page table for each 2 MiB written";
+    const uint64_t expected = kilobytes("RssAnon") + kilobytes("RssShmem") + kilobytes("VmSwap") + pageTables;
+    EXPECT_GE(kilobytes("RssShmem"), 16 * kPage);
+
+    const VSTaskHandle task = taskFor(child.pid());
+    VSTaskKernelMemoryInfo kernel;
+    uint32_t count = vs::kTaskKernelMemoryInfoCount;
+    ASSERT_EQ(platform.task_memory_info(task, kernel, count), 0);
+    EXPECT_GT(kernel.privateAllocated, pageTables) << "page tables and kernel stacks";
+    // Asked right after the kernel memory (as a target does), then anew.
+    for (const char *when : {"after the kernel memory", "on its own"}) {
+        VSResourceUsageInfo usage;
+        ASSERT_EQ(platform.pid_resource_usage(child.pid(), vs::kResourceUsageVersion4, usage), 0) << when;
+        EXPECT_EQ(usage.physVestage, expected) << when << "\n" << status;
+    }
+    platform.release_task_handle(task);
+}
+
 TEST_F(LinuxProcessTest, ProcessThatGoesAwayWhileRead) {
     struct Case {
         const char *what;

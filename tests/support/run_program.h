@@ -23,6 +23,7 @@ namespace vs::test {
 struct RunResult {
     std::string out, err;
     int status = -1;  // the exit status, or 128 + the signal
+    pid_t pid = -1;   // the program's, for what it must say or leave out about itself
 };
 
 struct RunSettings {
@@ -96,6 +97,7 @@ inline RunResult runProgram(const std::vector<std::string> &args, const RunSetti
     pthread_sigmask(SIG_SETMASK, &previous, nullptr);
     if (s.signalAfterStart != 0) kill(child, s.signalAfterStart);
     RunResult result;
+    result.pid = child;
     waitpid(child, &result.status, 0);
     result.status = WIFEXITED(result.status) ? WEXITSTATUS(result.status) : 128 + WTERMSIG(result.status);
     for (auto [fd, text] : {std::pair{out, &result.out}, std::pair{err, &result.err}}) {
