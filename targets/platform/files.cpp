@@ -84,7 +84,10 @@ std::string temporaryName(const std::string &base) {
     char suffix[24];
     std::snprintf(suffix, sizeof suffix, ".%016llx.tmp", static_cast<unsigned long long>(random));
     // Hidden, and short enough to stay within the name limit.
-    return "." + base.substr(0, 200) + suffix;
+    std::string name = ".";
+    name.append(base, 0, 200);
+    name += suffix;
+    return name;
 }
 
 // The directory part and the last name of `path`.

@@ -289,6 +289,48 @@ TEST(LiveRun, ReportThatCannotBeWrittenFailsTheRun) {
     EXPECT_EQ(run.err, "vestage: cannot write the report to standard output: No space left on device\n");
 }
 
+// Far more targets than fds: a run allowed 64 reads every one of 400
+// processes, and none is lost for want of an fd.
+TEST(LiveRun, MoreTargetsThanTheFileLimitAllows) {
+    if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";
+    constexpr int kChildren = 400;
+    std::vector<std::string> items{"anon:a:4:4"};
+    for (int i = 0; i < kChildren; ++i) items.push_back("fork:k" + std::to_string(i));
+    MemChild parent(items);
+    ASSERT_TRUE(parent.ready());
+    std::vector<std::string> pids{std::to_string(parent.pid())};
+    for (int i = 0; i < kChildren; ++i) pids.push_back(parent.fact("k" + std::to_string(i), "pid"));
+    const auto run = runProgram({"-t", "-p", pids.front()}, {.fileLimit = 64});
+    ASSERT_EQ(run.status, 0) << run.err;
+    EXPECT_EQ(run.err, "");
+    const size_t error = run.out.find("Errors were encountered");
+    EXPECT_EQ(error, std::string::npos) << run.out.substr(error == std::string::npos ? 0 : error, 2000);
+    std::vector<std::string> missing;
+    for (const std::string &pid : pids) {
+        if (pid.empty() || run.out.find("vs_memchild [" + pid + "]: ") == std::string::npos) missing.push_back(pid);
+    }
+    EXPECT_TRUE(missing.empty()) << missing.size() << " of " << pids.size() << " not reported, e.g. " << missing[0];
+}
+
+// The program never reads itself, neither among all processes nor when
+// its own name is asked for.
+TEST(LiveRun, TheProgramLeavesItselfOut) {
+    if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
+    const std::string thisTest = "[" + std::to_string(getpid()) + "]: ";
+    const std::pair<std::vector<std::string>, bool> cases[] = {{{"-a"}, true}, {{"-p", "vestage"}, false}};
+    for (const auto &[args, listsThisTest] : cases) {
+        SCOPED_TRACE(args.back());
+        const auto run = runProgram(args);
+        const std::string self = "[" + std::to_string(run.pid) + "]";
+        EXPECT_EQ(run.out.find(self), std::string::npos)
+            << self << " in:\n" << run.out.substr(0, run.out.find(self) + 200);
+        EXPECT_EQ(run.err.find(self), std::string::npos) << run.err;
+        if (listsThisTest) {
+            EXPECT_NE(run.out.find(thisTest), std::string::npos) << "other processes are read";
+        }
+    }
+}
+
 // Started with SIGINT ignored, as a background job of a script is: once
 // gathering is over an interrupt ends the program again.
 TEST(LiveRun, InterruptEndsThePrintingEvenWhenStartedIgnored) {

@@ -24,6 +24,9 @@
 //                                written (removed at once, so it goes with us)
 //   sparse:LABEL:GIB:TOUCHED     GIB GiB of anonymous address space reserved,
 //                                the first TOUCHED pages written
+//   tables:LABEL:GIB             GIB GiB of anonymous address space reserved,
+//                                one page written in every 2 MiB, so that
+//                                each needs a page table of its own
 //   mlock:LABEL:PAGES            anonymous memory written and locked
 //   free:LABEL:PAGES:FREED       anonymous memory written, then the first
 //                                FREED pages given back with MADV_FREE (and
@@ -317,6 +320,20 @@ int main(int argc, char **argv) {
             }
             madvise(start, bytes, MADV_NOHUGEPAGE);
             touch(static_cast<char *>(start), number(item[3]));
+            remember(label, start, bytes / kPage);
+            printRegion(label, start, bytes / kPage);
+        } else if (kind == "tables" && item.size() == 3) {
+            const size_t bytes = number(item[2]) << 30;
+            constexpr size_t kTableSpan = 2u << 20; // what one page table maps
+            void *start = mmap(nullptr, bytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE,
+                               -1, 0);
+            if (start == MAP_FAILED) {
+                fail("mmap tables");
+            }
+            madvise(start, bytes, MADV_NOHUGEPAGE);
+            for (size_t at = 0; at < bytes; at += kTableSpan) {
+                static_cast<char *>(start)[at] = 1;
+            }
             remember(label, start, bytes / kPage);
             printRegion(label, start, bytes / kPage);
         } else if (kind == "memfd" && item.size() == 4) {

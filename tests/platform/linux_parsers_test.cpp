@@ -39,7 +39,8 @@ std::string parsed(bool stat, std::string_view text) {
         const auto st = vs::parseStat(text);
         if (st) {
             result = "'" + st->comm + "' " + st->state + " ppid " + std::to_string(st->ppid) + " threads " +
-                     std::to_string(st->numThreads) + ((st->flags & vs::kLinuxKernelThreadFlag) ? " kthread" : "") +
+                     std::to_string(st->numThreads) + " start " + std::to_string(st->startTime) +
+                     ((st->flags & vs::kLinuxKernelThreadFlag) ? " kthread" : "") +
                      (vs::statSaysGone(*st) ? " gone" : "");
         }
         return result;
@@ -87,18 +88,21 @@ TEST(LinuxProcText, SmapsAndStatEdgeCases) {
          "400000-401000 @0 0:0 0 --p '' rss 0 pd 0 sd 0 lazy 0 swap 0 [none]"},
         {"smaps: an end below the start is no region", false, "402000-401000 r-xp 0 08:01 5 /bin/x\n", ""},
         {"stat: plain", true, "6276 (cat) R 6271 6271 3942 0 -1 4194304 101 0 1 0 0 0 0 0 20 0 1 0 32538 3133440 412\n",
-         "'cat' R ppid 6271 threads 1"},
+         "'cat' R ppid 6271 threads 1 start 32538"},
         {"stat: blanks and parentheses in the name", true,
-         "42 (a) b (c)) S 1 42 42 0 -1 4194560 1 0 0 0 0 0 0 0 20 0 3 0 5 0 0\n", "'a) b (c)' S ppid 1 threads 3"},
+         "42 (a) b (c)) S 1 42 42 0 -1 4194560 1 0 0 0 0 0 0 0 20 0 3 0 5 0 0\n",
+         "'a) b (c)' S ppid 1 threads 3 start 5"},
         {"stat: kernel thread", true, "2 (kthreadd) S 0 0 0 0 -1 2129984 0 0 0 0 0 0 0 0 20 0 1 0 1 0 0\n",
-         "'kthreadd' S ppid 0 threads 1 kthread"},
+         "'kthreadd' S ppid 0 threads 1 start 1 kthread"},
         {"stat: zombie", true, "77 (ex it) Z 76 76 1 0 -1 4227084 0 0 0 0 0 0 0 0 20 0 1 0 9 0 0\n",
-         "'ex it' Z ppid 76 threads 1 gone"},
+         "'ex it' Z ppid 76 threads 1 start 9 gone"},
         // SIGKILLed with 3 GiB: for a while it still runs, tearing its memory down.
         {"stat: exiting", true, "78 (big) R 1 78 78 0 -1 4194628 0 0 0 0 0 0 0 0 20 0 1 0 9 0 0\n",
-         "'big' R ppid 1 threads 1 gone"},
+         "'big' R ppid 1 threads 1 start 9 gone"},
         {"stat: empty name, no newline", true, "8 () S 1 8 8 0 -1 0 0 0 0 0 0 0 0 0 20 0 1 0 9 0 0",
-         "'' S ppid 1 threads 1"},
+         "'' S ppid 1 threads 1 start 9"},
+        {"stat: cut before the start time", true, "5 (x) S 1 5 5 0 -1 0 0 0 0 0 0 0 0 0 20 0 2 0",
+         "'x' S ppid 1 threads 2 start 0"},
         {"stat: cut after the name", true, "9 (x)", ""},
         {"stat: no parentheses", true, "9 x S 1", ""},
         {"stat: empty", true, "", ""},

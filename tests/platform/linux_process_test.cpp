@@ -4,6 +4,8 @@
 
 #include "model/memory_region.h"
 #include "targets/platform/linux/linux_platform.h"
+#include "targets/platform/linux/proc_reader.h"
+#include "targets/platform/linux/proc_text.h"
 #include "targets/platform/linux/smaps_parser.h"
 #include "tests/support/run_program.h"
 
@@ -18,7 +20,10 @@
 #include <set>
 #include <string>
 #include <tuple>
+#include <sched.h>
 #include <sys/mman.h>
+#include <sys/mount.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <vector>
@@ -451,6 +456,43 @@ TEST_F(LinuxProcessTest, SharedLibrarySegments) {
     EXPECT_NE(segmentWhere([](const auto &s) { return s.name == "__DATA"; }), libc->segments.end());
 }
 
+// The process-wide counters against the child's own status. Its page
+// tables are memory it costs: in its physical vestage and as kernel memory
+// of its own. One page written per 2 MiB makes them weigh.
+TEST_F(LinuxProcessTest, ProcessWideCountersIncludeThePageTables) {
+    MemChild child({"tables:t:1", "shared:s:16"});
+    ASSERT_TRUE(child.ready());
+    std::string status;
+    {
+        char buffer[4096];
+        const int fd = open(("/proc/" + std::to_string(child.pid()) + "/status").c_str(), O_RDONLY | O_CLOEXEC);
+        for (ssize_t n; fd >= 0 && (n = read(fd, buffer, sizeof buffer)) > 0;) status.append(buffer, n);
+        close(fd);
+    }
+    auto kilobytes = [&](const std::string &name) {
+        const size_t at = status.find("\n" + name + ":");
+        EXPECT_NE(at, std::string::npos) << name;
+        return at == std::string::npos ? 0 : std::strtoull(status.c_str() + at + name.size() + 2, nullptr, 10) * 1024;
+    };
+    const uint64_t pageTables = kilobytes("VmPTE");
+    ASSERT_GE(pageTables, 512 * kPage) << "a page table for each 2 MiB written";
+    const uint64_t expected = kilobytes("RssAnon") + kilobytes("RssShmem") + kilobytes("VmSwap") + pageTables;
+    EXPECT_GE(kilobytes("RssShmem"), 16 * kPage);
+
+    const VSTaskHandle task = taskFor(child.pid());
+    VSTaskKernelMemoryInfo kernel;
+    uint32_t count = vs::kTaskKernelMemoryInfoCount;
+    ASSERT_EQ(platform.task_memory_info(task, kernel, count), 0);
+    EXPECT_GT(kernel.privateAllocated, pageTables) << "page tables and kernel stacks";
+    // Asked right after the kernel memory (as a target does), then anew.
+    for (const char *when : {"after the kernel memory", "on its own"}) {
+        VSResourceUsageInfo usage;
+        ASSERT_EQ(platform.pid_resource_usage(child.pid(), vs::kResourceUsageVersion4, usage), 0) << when;
+        EXPECT_EQ(usage.physVestage, expected) << when << "\n" << status;
+    }
+    platform.release_task_handle(task);
+}
+
 TEST_F(LinuxProcessTest, ProcessThatGoesAwayWhileRead) {
     struct Case {
         const char *what;
@@ -493,6 +535,93 @@ TEST_F(LinuxProcessTest, ProcessThatGoesAwayWhileRead) {
         platform.release_task_handle(task);
     }
     EXPECT_EQ(platform.error_text(ESRCH), "No such process");
+}
+
+// Past its fd budget the layer holds no directory for a handle and opens
+// /proc/PID for each query. By then the pid may name another process,
+// which must read as the handle's process gone, never as the other one.
+// A pid namespace of the test's own makes the pid's reuse certain.
+TEST_F(LinuxProcessTest, HandleWithoutItsDirectoryNeverReadsALaterProcess) {
+    constexpr int kUnsupported = 77;
+    int report[2];
+    ASSERT_EQ(pipe2(report, O_CLOEXEC), 0);
+    const pid_t outer = fork();
+    if (outer == 0) {
+        if (unshare(CLONE_NEWPID | CLONE_NEWNS) != 0 || mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
+            _exit(kUnsupported);
+        }
+        const pid_t init = fork(); // pid 1 of the new namespace
+        if (init != 0) {
+            int status = 0;
+            waitpid(init, &status, 0);
+            _exit(WIFEXITED(status) ? WEXITSTATUS(status) : 3);
+        }
+        if (mount("proc", "/proc", "proc", 0, nullptr) != 0) {
+            _exit(kUnsupported);
+        }
+        const rlimit files{24, 24}; // too few for the layer to keep any directory
+        setrlimit(RLIMIT_NOFILE, &files);
+        auto sleeper = [] {
+            const pid_t pid = fork();
+            if (pid == 0) {
+                pause();
+                _exit(0);
+            }
+            return pid;
+        };
+        const pid_t first = sleeper();
+        VSLinuxPlatform limited;
+        VSTaskHandle task = 0;
+        VSTaskKernelMemoryInfo info;
+        uint32_t count = vs::kTaskKernelMemoryInfoCount;
+        int32_t results[5] = {limited.task_handle_for_pid(first, task), limited.task_memory_info(task, info, count)};
+        // Start times are in clock ticks: the later process starts in a later one.
+        std::string_view stat;
+        const auto started = vs::readFileAt(AT_FDCWD, ("/proc/" + std::to_string(first) + "/stat").c_str(), stat) == 0
+                                 ? vs::parseStat(stat)
+                                 : std::nullopt;
+        const uint64_t ticksPerSecond = static_cast<uint64_t>(sysconf(_SC_CLK_TCK));
+        for (timespec now{}; started && clock_gettime(CLOCK_BOOTTIME, &now) == 0 &&
+                             static_cast<uint64_t>(now.tv_sec) * ticksPerSecond +
+                                     static_cast<uint64_t>(now.tv_nsec) * ticksPerSecond / 1000000000 <=
+                                 started->startTime;) {
+            usleep(1000);
+        }
+        ::kill(first, SIGKILL);
+        waitpid(first, nullptr, 0);
+        const int lastPid = open("/proc/sys/kernel/ns_last_pid", O_WRONLY | O_CLOEXEC);
+        const std::string before = std::to_string(first - 1);
+        if (lastPid < 0 || write(lastPid, before.data(), before.size()) != static_cast<ssize_t>(before.size())) {
+            _exit(kUnsupported);
+        }
+        close(lastPid);
+        const pid_t second = sleeper();
+        results[2] = second == first;
+        count = vs::kTaskKernelMemoryInfoCount;
+        results[3] = limited.task_memory_info(task, info, count);
+        uint64_t address = 0, size = 0;
+        uint32_t depth = 0, infoCount = vs::kRegionInfoCount;
+        VSRegionInfo region;
+        results[4] = limited.region_recurse(task, address, size, depth, region, infoCount);
+        ::kill(second, SIGKILL);
+        waitpid(second, nullptr, 0);
+        _exit(write(report[1], results, sizeof results) == sizeof results ? 0 : 4);
+    }
+    close(report[1]);
+    int32_t results[5] = {-1, -1, -1, -1, -1};
+    const ssize_t got = read(report[0], results, sizeof results);
+    close(report[0]);
+    int status = 0;
+    waitpid(outer, &status, 0);
+    if (WIFEXITED(status) && WEXITSTATUS(status) == kUnsupported) {
+        GTEST_SKIP() << "no pid namespace of our own here";
+    }
+    ASSERT_EQ(got, static_cast<ssize_t>(sizeof results)) << "status " << status;
+    EXPECT_EQ(results[0], 0) << "the handle";
+    EXPECT_EQ(results[1], 0) << "a query through a directory opened again";
+    ASSERT_EQ(results[2], 1) << "the pid was handed on";
+    EXPECT_EQ(results[3], vs::kReturnDeadPort) << "kernel memory of the later process";
+    EXPECT_EQ(results[4], vs::kReturnDeadPort) << "regions of the later process";
 }
 
 TEST_F(LinuxProcessTest, ProcessThatExecsAfterItsHandleIsOpened) {

@@ -7,6 +7,7 @@
 #include <fcntl.h>
 #include <grp.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -22,6 +23,7 @@ namespace vs::test {
 struct RunResult {
     std::string out, err;
     int status = -1;  // the exit status, or 128 + the signal
+    pid_t pid = -1;   // the program's, for what it must say or leave out about itself
 };
 
 struct RunSettings {
@@ -34,6 +36,7 @@ struct RunSettings {
     bool closeOutputs = false, closeInput = false;
     uid_t user = 0;  // run as this user (and its own group) when not 0
     std::string standardOutput = "";  // a file to write standard output to, instead of the result
+    std::optional<rlim_t> fileLimit = std::nullopt;  // RLIMIT_NOFILE, soft and hard
 };
 
 // Drops to an unprivileged user for the rest of a forked child's life.
@@ -76,6 +79,10 @@ inline RunResult runProgram(const std::vector<std::string> &args, const RunSetti
             // dup2 onto itself would keep close-on-exec.
             *s.descriptor3 == 3 ? fcntl(3, F_SETFD, 0) : dup2(*s.descriptor3, 3);
         }
+        if (s.fileLimit) {
+            const rlimit files{*s.fileLimit, *s.fileLimit};
+            if (setrlimit(RLIMIT_NOFILE, &files) != 0) _exit(126);
+        }
         signal(SIGINT, SIG_DFL);
         if (!s.blockInterrupt) sigemptyset(&interrupt);
         sigprocmask(SIG_SETMASK, &interrupt, nullptr);
@@ -90,6 +97,7 @@ inline RunResult runProgram(const std::vector<std::string> &args, const RunSetti
     pthread_sigmask(SIG_SETMASK, &previous, nullptr);
     if (s.signalAfterStart != 0) kill(child, s.signalAfterStart);
     RunResult result;
+    result.pid = child;
     waitpid(child, &result.status, 0);
     result.status = WIFEXITED(result.status) ? WEXITSTATUS(result.status) : 128 + WTERMSIG(result.status);
     for (auto [fd, text] : {std::pair{out, &result.out}, std::pair{err, &result.err}}) {

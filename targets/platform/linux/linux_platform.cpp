@@ -22,11 +22,52 @@
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
+#include <thread>
 #include <unistd.h>
 
 using vs::ReadBuffer;
 using vs::SmapsRegion;
 using vs::UniqueFd;
+
+namespace {
+
+int openProc(int32_t pid, int flags) {
+    char path[64];
+    std::snprintf(path, sizeof path, "%s/%d", VSLinuxPlatform::kProcRoot, pid);
+    return ::open(path, flags | O_CLOEXEC);
+}
+
+// A process's /proc directory for the time one query reads through it:
+// the one its handle holds, or one opened for the query alone.
+class ProcessDir {
+public:
+    static ProcessDir held(int fd) {
+        ProcessDir dir;
+        dir._fd = fd;
+        return dir;
+    }
+    static ProcessDir opened(UniqueFd fd) {
+        ProcessDir dir;
+        dir._fd = fd.get();
+        dir._opened = std::move(fd);
+        return dir;
+    }
+    static ProcessDir failed(int error) {
+        ProcessDir dir;
+        dir._error = error;
+        return dir;
+    }
+    // -1 when the process could not be reached; error() then says why.
+    int get() const { return _fd; }
+    int error() const { return _error; }
+
+private:
+    UniqueFd _opened;
+    int _fd = -1;
+    int _error = 0;
+};
+
+} // namespace
 
 struct VSLinuxPlatform::Listed {
     UniqueFd dir;
@@ -49,7 +90,35 @@ struct VSLinuxPlatform::Task {
     };
 
     int32_t pid = 0;
+    // Held while fds are plentiful. Otherwise every query opens /proc/PID
+    // again, and the start time tells whether the pid still names this
+    // process: a pid reused by another one reads as this one gone. (The
+    // time is in clock ticks; a pid handed on within one tick would need
+    // the whole pid space to wrap meanwhile.)
     UniqueFd dir;
+    uint64_t startTime = 0;
+
+    // Both are set when the handle is made and never change, so they are
+    // read without the lock.
+    ProcessDir openDir() const {
+        if (dir.valid()) {
+            return ProcessDir::held(dir.get());
+        }
+        UniqueFd opened(openProc(pid, O_RDONLY | O_DIRECTORY));
+        if (!opened.valid()) {
+            return ProcessDir::failed(errno == ENOENT ? ESRCH : errno);
+        }
+        std::string_view text;
+        const int error = vs::readOnePieceFileAt(opened.get(), "stat", text);
+        if (error != 0) {
+            return ProcessDir::failed(error == ENOENT ? ESRCH : error);
+        }
+        const std::optional<vs::ProcStat> st = vs::parseStat(text);
+        if (!st || st->startTime != startTime) {
+            return ProcessDir::failed(ESRCH);
+        }
+        return ProcessDir::opened(std::move(opened));
+    }
 
     std::mutex mutex; // guards everything below
     // smaps, opened with the handle (the open is where the kernel checks
@@ -308,12 +377,6 @@ size_t regionAtOrAbove(const std::vector<SmapsRegion> &regions, uint64_t address
     return hint = regionAtOrAbove(regions, address);
 }
 
-int openProc(int32_t pid, int flags) {
-    char path[64];
-    std::snprintf(path, sizeof path, "%s/%d", VSLinuxPlatform::kProcRoot, pid);
-    return ::open(path, flags | O_CLOEXEC);
-}
-
 // Reads /proc/PID/<name> into the thread's buffer. 0 or the errno.
 int readPidFile(int32_t pid, const char *name, std::string_view &text, bool onePiece = false) {
     char path[96];
@@ -332,8 +395,8 @@ VSLinuxPlatform::VSLinuxPlatform() : _pageSize(static_cast<uint64_t>(::sysconf(_
     // it (the C library would otherwise raise that limit as it goes).
     ::mallopt(M_ARENA_MAX, 1);
     ::mallopt(M_MMAP_THRESHOLD, 256 * 1024);
-    // Every task handle holds a directory fd for the whole run, and a run
-    // over all processes opens one per process: lift the soft fd limit.
+    // A task handle holds its directory fd, and a run over all processes
+    // makes one per process: lift the soft fd limit so that most can.
     rlimit files{};
     if (::getrlimit(RLIMIT_NOFILE, &files) == 0) {
         if (files.rlim_cur < files.rlim_max) {
@@ -341,10 +404,14 @@ VSLinuxPlatform::VSLinuxPlatform() : _pageSize(static_cast<uint64_t>(::sysconf(_
             ::setrlimit(RLIMIT_NOFILE, &files);
             ::getrlimit(RLIMIT_NOFILE, &files);
         }
-        // Files kept open only to save opening them again are kept while
-        // half of the fds are free: the handles' directories, which a run
-        // needs, come first.
-        _keptFdLimit = static_cast<int>(std::min<rlim_t>(files.rlim_cur / 2, INT_MAX));
+        // Directories and files are kept open only to save opening them
+        // again, while half of the fds are free and never into what every
+        // gathering thread opens for a while (a handful each). Beyond that
+        // a handle opens its directory for each query.
+        const rlim_t threads = std::max(1u, std::thread::hardware_concurrency());
+        const rlim_t inUse = 16 + 8 * threads;
+        const rlim_t kept = std::min(files.rlim_cur / 2, files.rlim_cur > inUse ? files.rlim_cur - inUse : 0);
+        _keptFdLimit = static_cast<int>(std::min<rlim_t>(kept, INT_MAX));
     }
 }
 
@@ -659,16 +726,18 @@ int32_t VSLinuxPlatform::process_argument_area(int32_t pid, std::span<char> buff
     }
     // A target names itself right after opening its task: read through the
     // directory its handle holds rather than open /proc/PID once more.
-    UniqueFd dir;
-    std::shared_ptr<Task> task = _newestTaskForPid(pid);
-    if (!task) {
-        const int dirFd = openProc(pid, O_RDONLY | O_DIRECTORY);
-        if (dirFd < 0) {
-            return errno == ENOENT ? ESRCH : errno;
-        }
-        dir = UniqueFd(dirFd);
+    ProcessDir dir;
+    if (std::shared_ptr<Task> task = _newestTaskForPid(pid)) {
+        dir = task->openDir();
+    } else if (UniqueFd opened(openProc(pid, O_RDONLY | O_DIRECTORY)); opened.valid()) {
+        dir = ProcessDir::opened(std::move(opened));
+    } else {
+        dir = ProcessDir::failed(errno == ENOENT ? ESRCH : errno);
     }
-    const int dirFd = task ? task->dir.get() : dir.get();
+    const int dirFd = dir.get();
+    if (dirFd < 0) {
+        return dir.error();
+    }
     char exe[PATH_MAX + 1];
     const ssize_t exeLength = ::readlinkat(dirFd, "exe", exe, PATH_MAX);
     if (exeLength <= 0) {
@@ -765,6 +834,16 @@ VSReturnCode VSLinuxPlatform::task_handle_for_pid(int32_t pid, VSTaskHandle &tas
     if (entry->smaps.get() >= _keptFdLimit) {
         entry->smaps = UniqueFd(); // opened again by the parse
     }
+    if (entry->dir.get() >= _keptFdLimit) {
+        std::string_view text;
+        const int error = vs::readOnePieceFileAt(entry->dir.get(), "stat", text);
+        const std::optional<vs::ProcStat> st = error == 0 ? vs::parseStat(text) : std::nullopt;
+        if (!st) {
+            return error == 0 || error == ENOENT ? ESRCH : error;
+        }
+        entry->startTime = st->startTime;
+        entry->dir = UniqueFd();
+    }
     task = _registerTask(std::move(entry));
     return 0;
 }
@@ -812,6 +891,10 @@ const std::unordered_map<uint64_t, bool> &VSLinuxPlatform::_openableDevices() {
 }
 
 VSReturnCode VSLinuxPlatform::_parse(Task &task) {
+    const ProcessDir dir = task.openDir();
+    if (dir.get() < 0) {
+        return dir.error() == ESRCH ? vs::kReturnDeadPort : regionErrno(dir.error());
+    }
     // Parsed as it is read: the text of a process with many mappings is
     // never held whole.
     vs::SmapsParser parser(task.regions);
@@ -827,7 +910,7 @@ VSReturnCode VSLinuxPlatform::_parse(Task &task) {
         }
     }
     if (!task.smaps.valid()) {
-        task.smaps = UniqueFd(::openat(task.dir.get(), "smaps", O_RDONLY | O_CLOEXEC));
+        task.smaps = UniqueFd(::openat(dir.get(), "smaps", O_RDONLY | O_CLOEXEC));
         error = task.smaps.valid() ? vs::readInPieces(task.smaps.get(), vs::kRecordFileChunk, consume, bytes) : errno;
     }
     task.smaps = UniqueFd(); // a parse asked for again reads anew
@@ -835,10 +918,10 @@ VSReturnCode VSLinuxPlatform::_parse(Task &task) {
         std::vector<SmapsRegion>().swap(task.regions);
         return (error == ESRCH || error == ENOENT) ? vs::kReturnDeadPort : regionErrno(error);
     }
-    if (task.regions.empty() && processHasGone(task.dir.get())) {
+    if (task.regions.empty() && processHasGone(dir.get())) {
         return vs::kReturnDeadPort;
     }
-    const std::vector<uint64_t> stackPointers = threadStackPointers(task.dir.get());
+    const std::vector<uint64_t> stackPointers = threadStackPointers(dir.get());
     const std::vector<uint64_t> &tmpfs = _tmpfsDevices();
     task.kinds.reserve(task.regions.size());
     task.tags.reserve(task.regions.size());
@@ -883,7 +966,7 @@ void VSLinuxPlatform::_buildParts(Task &task) {
                                   runs);
             } else {
                 if (!pagemap.valid()) {
-                    pagemap = UniqueFd(::openat(task.dir.get(), "pagemap", O_RDONLY | O_CLOEXEC));
+                    pagemap = UniqueFd(::openat(task.openDir().get(), "pagemap", O_RDONLY | O_CLOEXEC));
                     pagemapFailed = !pagemap.valid();
                 }
                 if (pagemap.valid()) {
@@ -1111,7 +1194,7 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
             continue;
         }
         if (!pagemap.valid()) {
-            pagemap = UniqueFd(::openat(task->dir.get(), "pagemap", O_RDONLY | O_CLOEXEC));
+            pagemap = UniqueFd(::openat(task->openDir().get(), "pagemap", O_RDONLY | O_CLOEXEC));
             if (!pagemap.valid()) {
                 // The walk reports the process; nothing to share from it.
                 return false;
@@ -1385,7 +1468,11 @@ VSReturnCode VSLinuxPlatform::page_range_query(VSTaskHandle handle, uint64_t add
             }
         }
     }
-    const int pagemap = ::openat(task->dir.get(), "pagemap", O_RDONLY | O_CLOEXEC);
+    const ProcessDir dir = task->openDir();
+    if (dir.get() < 0) {
+        return dir.error() == ESRCH ? vs::kReturnInvalidArgument : dir.error();
+    }
+    const int pagemap = ::openat(dir.get(), "pagemap", O_RDONLY | O_CLOEXEC);
     if (pagemap < 0) {
         return (errno == ESRCH || errno == ENOENT) ? vs::kReturnInvalidArgument : errno;
     }
@@ -1470,8 +1557,9 @@ VSReturnCode VSLinuxPlatform::task_memory_info(VSTaskHandle handle, VSTaskKernel
     if (count < vs::kTaskKernelMemoryInfoCount) {
         return EINVAL;
     }
+    const ProcessDir dir = task->openDir();
     std::string_view status;
-    const int error = vs::readOnePieceFileAt(task->dir.get(), "status", status);
+    const int error = dir.get() < 0 ? dir.error() : vs::readOnePieceFileAt(dir.get(), "status", status);
     if (error != 0) {
         return (error == ESRCH || error == ENOENT) ? vs::kReturnDeadPort : error;
     }
@@ -1500,7 +1588,11 @@ std::vector<VSSymbolicatorImage> VSLinuxPlatform::symbolicator(VSTaskHandle hand
     if (_ensureParsed(*task) != 0) {
         return result;
     }
-    MappedFileContext context{task->dir.get(), task->regions, _pageSize, _openableDevices(), false, {}, {}};
+    const ProcessDir dir = task->openDir();
+    if (dir.get() < 0) {
+        return result;
+    }
+    MappedFileContext context{dir.get(), task->regions, _pageSize, _openableDevices(), false, {}, {}};
     const auto images = vs::processImages(task->regions, _pageSize, vs::ElfCache::shared(),
                                           readMappedFile, &context);
     result.reserve(images.size());

@@ -5,7 +5,10 @@
 // A task handle is a small integer naming an entry of a table; the entry
 // holds an open /proc/PID directory fd and every later read goes through
 // openat() on it. Once the process is reaped those opens fail with ESRCH,
-// so a handle never reads a process that reused the pid.
+// so a handle never reads a process that reused the pid. Past a budget of
+// fds drawn from RLIMIT_NOFILE the entry holds none: each query opens the
+// directory again and compares the process's start time with the one seen
+// when the handle was made, so any fd limit serves any number of targets.
 //
 // The region queries answer from one parse of /proc/PID/smaps per handle,
 // made on first use and kept on the handle until a walk has passed the last

@@ -96,6 +96,9 @@ std::optional<ProcStat> parseStat(std::string_view text) {
     }
     skipBlanks(text, pos);
     readDecimal(text, pos, st.numThreads);
+    skipField(text, pos); // itrealvalue
+    skipBlanks(text, pos);
+    readDecimal(text, pos, st.startTime); // field 22
     return st;
 }
 

@@ -22,6 +22,9 @@ struct ProcStat {
     int32_t ppid = 0;
     uint64_t flags = 0; // PF_* bits
     uint64_t numThreads = 0;
+    // Clock ticks after boot when the process started: with the pid, it
+    // names one process, since a pid is reused only after its process ended.
+    uint64_t startTime = 0;
 };
 
 inline constexpr uint64_t kLinuxKernelThreadFlag = 0x00200000; // PF_KTHREAD
