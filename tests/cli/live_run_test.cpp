@@ -161,21 +161,39 @@ std::set<uint64_t> mappedFilePages(pid_t pid, const std::string &path) {
     return pages;
 }
 
-// A file that processes map privately and read in different parts: its page
-// cache counts once, as the union of the pages they hold.
-TEST(LiveRun, PrivateMappingsOfOneFileHoldTheUnionOfTheirPages) {
-    if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";
-    // Next to the test programs: a disk file system, whose pages are page cache.
-    const std::string path = VESTAGE_TEST_BIN_DIR "/vs_window_test_" + std::to_string(getpid());
-    const uint64_t pages = 64; // a multiple of the kernel's fault-around window
+// A file of `pages` pages next to the test programs (a disk file system,
+// whose pages are page cache), written to disk so that they are clean.
+std::string cleanFile(const std::string &name, uint64_t pages) {
+    const std::string path = VESTAGE_TEST_BIN_DIR "/" + name + "_" + std::to_string(getpid());
     {
         std::ofstream out(path, std::ios::binary);
         out << std::string(pages * kPage, 'w');
     }
     const int fd = open(path.c_str(), O_RDONLY);
-    ASSERT_GE(fd, 0);
-    fsync(fd); // clean page cache: every page a clean one
-    close(fd);
+    if (fd >= 0) {
+        fsync(fd);
+        close(fd);
+    }
+    return path;
+}
+
+// Dirty bytes, then clean bytes, of the summary's `category` row.
+std::pair<uint64_t, uint64_t> summaryRow(const std::string &report, const std::string &category) {
+    const size_t at = report.find("Summary Vestage"), row = report.find("    " + category + "\n", at);
+    if (at == std::string::npos || row == std::string::npos) return {0, 0};
+    std::istringstream fields(report.substr(report.rfind('\n', row) + 1));
+    uint64_t dirty = 0, clean = 0;
+    std::string unit;
+    fields >> dirty >> unit >> clean;
+    return {dirty, clean};
+}
+
+// A file that processes map privately and read in different parts: its page
+// cache counts once, as the union of the pages they hold.
+TEST(LiveRun, PrivateMappingsOfOneFileHoldTheUnionOfTheirPages) {
+    if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";
+    const uint64_t pages = 64; // a multiple of the kernel's fault-around window
+    const std::string path = cleanFile("vs_window_test", pages);
     auto reads = [&](uint64_t first, uint64_t count) {
         return "file:f:" + path + ":" + std::to_string(first) + ":" + std::to_string(count);
     };
@@ -200,15 +218,23 @@ TEST(LiveRun, PrivateMappingsOfOneFileHoldTheUnionOfTheirPages) {
         EXPECT_EQ(held.size() > std::max(heldByA.size(), heldByB.size()), scene.eachHoldsSome);
         const auto run = runProgram({"-f", "bytes", "-p", std::to_string(a.pid()), "-p", std::to_string(b.pid())});
         ASSERT_EQ(run.status, 0) << run.err;
-        // The clean column of the summary's row.
-        const size_t at = run.out.find("Summary Vestage"), row = run.out.find("    mapped file\n", at);
-        ASSERT_NE(row, std::string::npos) << run.out;
-        std::istringstream fields(run.out.substr(run.out.rfind('\n', row) + 1));
-        uint64_t dirty = 0, clean = 0;
-        std::string unit;
-        fields >> dirty >> unit >> clean;
+        const auto [dirty, clean] = summaryRow(run.out, "mapped file");
         EXPECT_EQ(dirty + clean, held.size() * kPage) << run.out;
     }
+    unlink(path.c_str());
+}
+
+// The copies a process made of a privately mapped file are its own dirty
+// memory, named after the file whether or not it still maps page cache.
+TEST(LiveRun, CopiesOfAFileAreNamedAfterIt) {
+    if (geteuid() != 0) GTEST_SKIP() << "reading another process's memory needs root";
+    const uint64_t pages = 16;
+    const std::string path = cleanFile("vs_copies_test", pages);
+    MemChild child({"pfile:all:" + path + ":" + std::to_string(pages), "pfile:half:" + path + ":8"});
+    ASSERT_TRUE(child.ready());
+    const auto run = runProgram({"-f", "bytes", "-p", std::to_string(child.pid())});
+    ASSERT_EQ(run.status, 0) << run.err;
+    EXPECT_EQ(dirtyIn(run.out, ": 64-bit", "mapped file"), (pages + 8) * kPage) << run.out;
     unlink(path.c_str());
 }
 

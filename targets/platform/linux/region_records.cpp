@@ -246,11 +246,11 @@ std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind 
             filePages = objectPages->residentPages;
             fileDirty = objectPages->dirtyPages;
         }
+        // Always first, even when every page is a copy: the walk names a
+        // mapping's parts after the file its first part is backed by.
         const uint32_t id = ids.idForFileWindow(device, region.inode, region.offset);
-        if (filePages > 0 || ownPresent + ownSwapped + sharedPresent + sharedSwapped == 0) {
-            parts.push_back(part(common, region, id, region.offset, {filePages, fileDirty, 0, 0}, droppable,
-                                 kShareModeShared));
-        }
+        parts.push_back(part(common, region, id, region.offset, {filePages, fileDirty, 0, 0}, droppable,
+                             kShareModeShared));
     }
     if (ownPresent + ownSwapped > 0 || (parts.empty() && sharedPresent + sharedSwapped == 0)) {
         parts.push_back(part(common, region, ids.freshId(), 0,
