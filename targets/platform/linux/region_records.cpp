@@ -286,42 +286,43 @@ VSRegionBasicInfo basicInfoFor(const SmapsRegion &region, MappingKind kind, uint
 
 namespace {
 
-// The fields of a record, in packing order. Members, not references: the
-// record is packed and its 64-bit offset is not naturally aligned.
-constexpr auto kRecordFields = std::make_tuple(
-        &VSRegionInfo::protection, &VSRegionInfo::maxProtection, &VSRegionInfo::inheritance, &VSRegionInfo::offset,
-        &VSRegionInfo::userTag, &VSRegionInfo::residentPages, &VSRegionInfo::sharedNowPrivatePages,
-        &VSRegionInfo::swappedOutPages, &VSRegionInfo::dirtiedPages, &VSRegionInfo::referenceCount,
-        &VSRegionInfo::shadowDepth, &VSRegionInfo::externalPager, &VSRegionInfo::shareMode, &VSRegionInfo::isSubmap,
-        &VSRegionInfo::behaviour, &VSRegionInfo::objectId, &VSRegionInfo::userWiredCount, &VSRegionInfo::_padding,
-        &VSRegionInfo::reusablePages);
+// The fields of a record, in packing order, each read and written by name:
+// the record is packed, its 64-bit offset is not naturally aligned, and a
+// member pointer or reference to it would read it as if it were.
+#define VS_RECORD_FIELDS(FIELD)                                                                                   \
+    FIELD(protection) FIELD(maxProtection) FIELD(inheritance) FIELD(offset) FIELD(userTag) FIELD(residentPages)  \
+    FIELD(sharedNowPrivatePages) FIELD(swappedOutPages) FIELD(dirtiedPages) FIELD(referenceCount)               \
+    FIELD(shadowDepth) FIELD(externalPager) FIELD(shareMode) FIELD(isSubmap) FIELD(behaviour) FIELD(objectId)   \
+    FIELD(userWiredCount) FIELD(_padding) FIELD(reusablePages)
 
-template <class Visit>
-void forEachRecordField(Visit visit) {
-    std::apply([&](auto... member) { (visit(member), ...); }, kRecordFields);
+// The unsigned number of a field's width packs it (the signed fields come
+// back through the same cast).
+template <class Field>
+void putField(std::vector<uint8_t> &out, Field value) {
+    putPackedNumber(out, static_cast<std::make_unsigned_t<Field>>(value));
 }
 
-// A field's type, and the unsigned number of its width that packs it (the
-// signed fields come back through the same cast).
-template <class Member>
-using FieldOf = std::remove_cvref_t<decltype(std::declval<VSRegionInfo &>().*std::declval<Member>())>;
+template <class Field>
+Field takeField(std::span<const uint8_t> bytes, size_t &at) {
+    return static_cast<Field>(static_cast<std::make_unsigned_t<Field>>(takePackedNumber(bytes, at)));
+}
 
 } // namespace
 
 void packRegionInfo(const VSRegionInfo &info, std::vector<uint8_t> &out) {
-    forEachRecordField([&](auto member) {
-        using Field = FieldOf<decltype(member)>;
-        putPackedNumber(out, static_cast<std::make_unsigned_t<Field>>(info.*member));
-    });
+#define VS_PUT_FIELD(name) putField<decltype(VSRegionInfo::name)>(out, info.name);
+    VS_RECORD_FIELDS(VS_PUT_FIELD)
+#undef VS_PUT_FIELD
 }
 
 VSRegionInfo unpackRegionInfo(std::span<const uint8_t> bytes, size_t &at) {
     VSRegionInfo info;
-    forEachRecordField([&](auto member) {
-        using Field = FieldOf<decltype(member)>;
-        info.*member = static_cast<Field>(static_cast<std::make_unsigned_t<Field>>(takePackedNumber(bytes, at)));
-    });
+#define VS_TAKE_FIELD(name) info.name = takeField<decltype(VSRegionInfo::name)>(bytes, at);
+    VS_RECORD_FIELDS(VS_TAKE_FIELD)
+#undef VS_TAKE_FIELD
     return info;
 }
+
+#undef VS_RECORD_FIELDS
 
 } // namespace vs

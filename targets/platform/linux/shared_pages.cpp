@@ -140,28 +140,32 @@ void SharedPageIndex::PageTable::clear() {
     _count = 0;
 }
 
-uint32_t SharedPageIndex::_internSet(std::vector<int32_t> members) {
-    auto [entry, added] = _setIds.try_emplace(members, static_cast<uint32_t>(_sets.size()));
-    if (added) {
-        _sets.push_back(std::move(members));
-    }
-    return entry->second;
+namespace {
+
+// Two unrelated mixes of a pid (splitmix64 finalisers with other seeds).
+uint64_t mixed(int32_t pid, uint64_t seed) {
+    uint64_t z = static_cast<uint64_t>(static_cast<uint32_t>(pid)) + seed;
+    z = (z ^ (z >> 30)) * 0xBF58476D1CE4E5B9ull;
+    z = (z ^ (z >> 27)) * 0x94D049BB133111EBull;
+    return z ^ (z >> 31);
 }
+
+} // namespace
 
 uint32_t SharedPageIndex::_setWith(uint32_t set, int32_t pid) {
     const uint64_t transition = (uint64_t{set} << 32) | static_cast<uint32_t>(pid);
     if (auto found = _transitions.find(transition); found != _transitions.end()) {
         return found->second;
     }
-    std::vector<int32_t> members = _sets[set];
-    const auto at = std::lower_bound(members.begin(), members.end(), pid);
-    uint32_t result = set;
-    if (at == members.end() || *at != pid) {
-        members.insert(at, pid);
-        result = _internSet(std::move(members));
+    const SetEntry &from = _sets[set];
+    const SetKey key{from.size + 1, from.sum1 + mixed(pid, 0x9E3779B97F4A7C15ull),
+                     from.sum2 + mixed(pid, 0xD1B54A32D192ED03ull)};
+    auto [entry, added] = _setIds.try_emplace(key, static_cast<uint32_t>(_sets.size()));
+    if (added) {
+        _sets.push_back(SetEntry{key.size, set, pid, key.sum1, key.sum2});
     }
-    _transitions.emplace(transition, result);
-    return result;
+    _transitions.emplace(transition, entry->second);
+    return entry->second;
 }
 
 template <typename Piece>
@@ -255,12 +259,16 @@ void SharedPageIndex::addPages(int32_t pid, std::span<const KeyRun> runs) {
                 const uint64_t count = std::min<uint64_t>(left, PageTable::kLanes - lane);
                 const uint64_t page = piece.page + (key - piece.first);
                 for (uint64_t k = lane; k < lane + count; ++k) {
+                    lanes[k].lowestPage = std::min(lanes[k].lowestPage, page + (k - lane));
+                    if (lanes[k].lastPid == pid) {
+                        continue; // mapped twice by this target: still one member
+                    }
                     if (lanes[k].set != lastFrom) {
                         lastFrom = lanes[k].set;
                         lastTo = step(lastFrom);
                     }
                     lanes[k].set = lastTo;
-                    lanes[k].lowestPage = std::min(lanes[k].lowestPage, page + (k - lane));
+                    lanes[k].lastPid = pid;
                 }
                 key += count;
                 left -= count;
@@ -309,12 +317,17 @@ void SharedPageIndex::sharedPages(std::span<const KeyRun> runs, std::vector<SetP
     if (!frozen) {
         lock.lock();
     }
-    std::erase_if(out, [&](const SetPages &entry) { return _sets[entry.set].size() < 2; });
+    std::erase_if(out, [&](const SetPages &entry) { return _sets[entry.set].size < 2; });
 }
 
 std::vector<int32_t> SharedPageIndex::setMembers(uint32_t set) const {
     std::lock_guard<std::mutex> lock(_mutex);
-    return set < _sets.size() ? _sets[set] : std::vector<int32_t>{};
+    std::vector<int32_t> members;
+    for (uint32_t at = set < _sets.size() ? set : 0; at != 0; at = _sets[at].from) {
+        members.push_back(_sets[at].added);
+    }
+    std::sort(members.begin(), members.end());
+    return members;
 }
 
 void SharedPageIndex::addWindow(const Window &window) {
@@ -354,8 +367,8 @@ std::optional<ObjectPages> SharedPageIndex::objectPages(uint64_t device, uint64_
 
 void SharedPageIndex::clear() {
     std::lock_guard<std::mutex> lock(_mutex);
-    _sets.assign(1, {});
-    _setIds = {{{}, 0}};
+    _sets.assign(1, SetEntry{});
+    _setIds = {{SetKey{0, 0, 0}, 0}};
     _transitions.clear();
     _objects.clear();
     for (Shard &shard : _shards) {

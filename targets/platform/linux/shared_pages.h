@@ -129,7 +129,6 @@ private:
         uint64_t unknownDirty = 0; // the most dirty pages one mapping of unknown state had
     };
 
-    uint32_t _internSet(std::vector<int32_t> members);
     uint32_t _setWith(uint32_t set, int32_t pid);
 
     // Page key -> set, by blocks of 8 neighbouring keys (a process's
@@ -151,6 +150,7 @@ private:
     // page at which a target maps it.
     struct Lane {
         uint32_t set = 0;
+        int32_t lastPid = 0; // the target that added it last: a page it adds twice is still one
         uint64_t lowestPage = UINT64_MAX;
     };
     class PageTable {
@@ -185,9 +185,27 @@ private:
     mutable std::mutex _mutex; // the sets and the objects
     std::atomic<bool> _frozen{false};
     mutable std::array<Shard, kShards> _shards;
-    // Set 0 is the empty set; a page's entry names the targets seen so far.
-    std::vector<std::vector<int32_t>> _sets{{}};
-    std::map<std::vector<int32_t>, uint32_t> _setIds{{{}, 0}};
+    // A page's set names the targets seen so far. A fork family of N
+    // passes through sets of 1, 2, ... N members, so members are never
+    // listed: a set is known by its size and two sums of its members'
+    // hashes (the same in whatever order they came), and keeps the set it
+    // was first made from and the member added to it. Set 0 is the empty set.
+    struct SetEntry {
+        uint32_t size = 0;
+        uint32_t from = 0;
+        int32_t added = 0;
+        uint64_t sum1 = 0, sum2 = 0;
+    };
+    struct SetKey {
+        uint32_t size;
+        uint64_t sum1, sum2;
+        bool operator==(const SetKey &) const = default;
+    };
+    struct SetKeyHash {
+        size_t operator()(const SetKey &key) const { return static_cast<size_t>(key.sum1 ^ (key.sum2 >> 7) ^ key.size); }
+    };
+    std::vector<SetEntry> _sets{SetEntry{}};
+    std::unordered_map<SetKey, uint32_t, SetKeyHash> _setIds{{SetKey{0, 0, 0}, 0}};
     std::unordered_map<uint64_t, uint32_t> _transitions; // (set << 32 | pid) -> set
     std::map<std::tuple<uint64_t, uint64_t, bool>, ObjectBits> _objects; // device, inode, private
 };
