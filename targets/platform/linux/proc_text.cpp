@@ -25,7 +25,12 @@ bool readSigned(std::string_view s, size_t &pos, int64_t &value) {
     if (!readDecimal(s, pos, magnitude)) {
         return false;
     }
-    value = negative ? -static_cast<int64_t>(magnitude) : static_cast<int64_t>(magnitude);
+    // A number out of range is no field of the kernel's: refused, also
+    // because negating it as a signed value would overflow.
+    if (magnitude > (negative ? uint64_t{1} << 63 : uint64_t{INT64_MAX})) {
+        return false;
+    }
+    value = static_cast<int64_t>(negative ? 0 - magnitude : magnitude);
     return true;
 }
 
