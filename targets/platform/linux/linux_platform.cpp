@@ -1183,6 +1183,8 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
     }
     UniqueFd pagemap;
     thread_local std::vector<vs::KeyRun> runs;
+    thread_local std::vector<vs::KeyRun> allRuns;
+    allRuns.clear();
     bool framesUnreadable = false;
     bool any = false;
     for (size_t i = 0; i < task->regions.size(); ++i) {
@@ -1204,7 +1206,7 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
             any = true;
             runs.clear();
             _candidateKeys(pagemap.get(), region, runs, &framesUnreadable);
-            _sharedPages.addPages(task->pid, runs);
+            allRuns.insert(allRuns.end(), runs.begin(), runs.end());
             const size_t before = task->storedBytes.size();
             vs::encodeKeyRuns(runs, task->storedBytes);
             task->storedKeys.push_back({region.start, region.end, before, task->storedBytes.size() - before});
@@ -1213,6 +1215,9 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
             any = _addWindow(pagemap.get(), region, kind) || any;
         }
     }
+    // All at once: a page the target maps twice is then still one member.
+    _sharedPages.addPages(task->pid, allRuns);
+    allRuns.clear();
     if (framesUnreadable) {
         _sharedFramesUnreadable.store(true);
     }

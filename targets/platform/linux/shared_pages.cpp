@@ -85,22 +85,22 @@ void decodeKeyRuns(std::span<const uint8_t> bytes, std::vector<KeyRun> &runs) {
     }
 }
 
-const SharedPageIndex::Lane *SharedPageIndex::PageTable::find(uint64_t block) const {
+size_t SharedPageIndex::PageTable::find(uint64_t block) const {
     if (_blocks.empty()) {
-        return nullptr;
+        return kNoSlot;
     }
     const size_t mask = _blocks.size() - 1;
     for (size_t slot = slotOf(block, mask);; slot = (slot + 1) & mask) {
         if (_blocks[slot] == block + 1) {
-            return &_lanes[slot * kLanes];
+            return slot;
         }
         if (_blocks[slot] == 0) {
-            return nullptr;
+            return kNoSlot;
         }
     }
 }
 
-SharedPageIndex::Lane *SharedPageIndex::PageTable::findOrAdd(uint64_t block) {
+size_t SharedPageIndex::PageTable::findOrAdd(uint64_t block) {
     if ((_count + 1) * 10 > _blocks.size() * 7) {
         _grow();
     }
@@ -113,12 +113,13 @@ SharedPageIndex::Lane *SharedPageIndex::PageTable::findOrAdd(uint64_t block) {
         _blocks[slot] = block + 1;
         ++_count;
     }
-    return &_lanes[slot * kLanes];
+    return slot;
 }
 
 void SharedPageIndex::PageTable::_grow() {
     std::vector<uint64_t> blocks(std::max<size_t>(1024, _blocks.size() * 2), 0);
-    std::vector<Lane> lanes(blocks.size() * kLanes);
+    std::vector<uint32_t> sets(blocks.size() * kLanes, 0);
+    std::vector<uint64_t> lowest(blocks.size() * kLanes, UINT64_MAX);
     const size_t mask = blocks.size() - 1;
     for (size_t i = 0; i < _blocks.size(); ++i) {
         if (_blocks[i] != 0) {
@@ -127,16 +128,19 @@ void SharedPageIndex::PageTable::_grow() {
                 slot = (slot + 1) & mask;
             }
             blocks[slot] = _blocks[i];
-            std::copy_n(&_lanes[i * kLanes], kLanes, &lanes[slot * kLanes]);
+            std::copy_n(&_sets[i * kLanes], kLanes, &sets[slot * kLanes]);
+            std::copy_n(&_lowest[i * kLanes], kLanes, &lowest[slot * kLanes]);
         }
     }
     _blocks.swap(blocks);
-    _lanes.swap(lanes);
+    _sets.swap(sets);
+    _lowest.swap(lowest);
 }
 
 void SharedPageIndex::PageTable::clear() {
     std::vector<uint64_t>().swap(_blocks);
-    std::vector<Lane>().swap(_lanes);
+    std::vector<uint32_t>().swap(_sets);
+    std::vector<uint64_t>().swap(_lowest);
     _count = 0;
 }
 
@@ -158,6 +162,9 @@ uint32_t SharedPageIndex::_setWith(uint32_t set, int32_t pid) {
         return found->second;
     }
     const SetEntry &from = _sets[set];
+    if (set != 0 && from.added == pid) {
+        return set; // a page the target maps twice: still one member
+    }
     const SetKey key{from.size + 1, from.sum1 + mixed(pid, 0x9E3779B97F4A7C15ull),
                      from.sum2 + mixed(pid, 0xD1B54A32D192ED03ull)};
     auto [entry, added] = _setIds.try_emplace(key, static_cast<uint32_t>(_sets.size()));
@@ -180,37 +187,6 @@ void SharedPageIndex::_forEachPiece(const KeyRun &run, Piece &&piece) {
         piece(_shardOf(key), key, count);
         key += count;
         left -= count;
-    }
-}
-
-template <typename Each>
-void SharedPageIndex::_setsOf(size_t shard, uint64_t first, uint64_t length, Each &&each) const {
-    const PageTable &table = _shards[shard].pages;
-    const Lane none;
-    uint32_t stretchSet = 0;
-    uint64_t stretch = 0, stretchStart = 0, stretchLowest = UINT64_MAX;
-    for (uint64_t key = first, left = length; left > 0;) {
-        const Lane *lanes = table.find(key >> kBlockShift);
-        const uint64_t lane = key & (PageTable::kLanes - 1);
-        const uint64_t count = std::min<uint64_t>(left, PageTable::kLanes - lane);
-        for (uint64_t k = lane; k < lane + count; ++k) {
-            const Lane &found = lanes == nullptr ? none : lanes[k];
-            if (found.set != stretchSet || stretch == 0) {
-                if (stretch > 0) {
-                    each(stretchSet, stretch, stretchStart, stretchLowest);
-                }
-                stretchSet = found.set;
-                stretchStart = key - first + (k - lane);
-                stretchLowest = found.lowestPage;
-                stretch = 0;
-            }
-            ++stretch;
-        }
-        key += count;
-        left -= count;
-    }
-    if (stretch > 0) {
-        each(stretchSet, stretch, stretchStart, stretchLowest);
     }
 }
 
@@ -254,21 +230,20 @@ void SharedPageIndex::addPages(int32_t pid, std::span<const KeyRun> runs) {
         uint32_t lastFrom = UINT32_MAX, lastTo = 0;
         for (const KeyRun &piece : byShard[shard]) {
             for (uint64_t key = piece.first, left = piece.length; left > 0;) {
-                Lane *lanes = _shards[shard].pages.findOrAdd(key >> kBlockShift);
+                PageTable &table = _shards[shard].pages;
+                const size_t slot = table.findOrAdd(key >> kBlockShift);
+                uint32_t *sets = table.sets(slot);
+                uint64_t *lowest = table.lowestPages(slot);
                 const uint64_t lane = key & (PageTable::kLanes - 1);
                 const uint64_t count = std::min<uint64_t>(left, PageTable::kLanes - lane);
                 const uint64_t page = piece.page + (key - piece.first);
                 for (uint64_t k = lane; k < lane + count; ++k) {
-                    lanes[k].lowestPage = std::min(lanes[k].lowestPage, page + (k - lane));
-                    if (lanes[k].lastPid == pid) {
-                        continue; // mapped twice by this target: still one member
-                    }
-                    if (lanes[k].set != lastFrom) {
-                        lastFrom = lanes[k].set;
+                    lowest[k] = std::min(lowest[k], page + (k - lane));
+                    if (sets[k] != lastFrom) {
+                        lastFrom = sets[k];
                         lastTo = step(lastFrom);
                     }
-                    lanes[k].set = lastTo;
-                    lanes[k].lastPid = pid;
+                    sets[k] = lastTo;
                 }
                 key += count;
                 left -= count;
@@ -287,31 +262,51 @@ std::optional<uint32_t> SharedPageIndex::sharedSet(uint64_t key) const {
 void SharedPageIndex::sharedPages(std::span<const KeyRun> runs, std::vector<SetPages> &out) const {
     out.clear();
     const bool frozen = _frozen.load();
+    // The set of a key and, when asked, the lowest page it is mapped at.
+    // While pages are still added: the shard's lock here, the sets' lock
+    // below, never both (adding takes them nested the other way round).
+    uint64_t lastBlock = UINT64_MAX;
+    size_t slot = PageTable::kNoSlot;
+    const PageTable *table = nullptr;
+    auto lookUp = [&](uint64_t key, uint64_t *lowest) {
+        Shard &shard = _shards[_shardOf(key)];
+        std::unique_lock<std::mutex> lock(shard.mutex, std::defer_lock);
+        if (!frozen) {
+            lock.lock();
+            lastBlock = UINT64_MAX; // a table still growing moves its slots
+        }
+        if ((key >> kBlockShift) != lastBlock) {
+            lastBlock = frozen ? key >> kBlockShift : UINT64_MAX;
+            table = &shard.pages;
+            slot = table->find(key >> kBlockShift);
+        }
+        const size_t lane = key & (PageTable::kLanes - 1);
+        if (lowest != nullptr) {
+            *lowest = slot == PageTable::kNoSlot ? UINT64_MAX : table->lowestPages(slot)[lane];
+        }
+        return slot == PageTable::kNoSlot ? 0u : table->sets(slot)[lane];
+    };
+    // A region meets few sets, mostly one after the other: the last entry
+    // first, then a short list.
+    size_t last = SIZE_MAX;
     for (const KeyRun &run : runs) {
         const bool swapped = (run.first & kSwapKey) != 0;
-        _forEachPiece(run, [&](size_t shard, uint64_t first, uint64_t length) {
-            // A region meets few sets: a short list beats a map.
-            auto add = [&](uint32_t set, uint64_t count, uint64_t skipped, uint64_t lowestPage) {
-                auto entry = out.begin();
-                while (entry != out.end() && entry->set != set) {
-                    ++entry;
+        for (uint64_t i = 0; i < run.length; ++i) {
+            const uint32_t set = lookUp(run.first + i, nullptr);
+            if (last == SIZE_MAX || out[last].set != set) {
+                last = 0;
+                while (last < out.size() && out[last].set != set) {
+                    ++last;
                 }
-                if (entry == out.end()) {
-                    const uint64_t page = run.page + (first - run.first) + skipped;
-                    entry = out.insert(out.end(), SetPages{set, 0, 0, page, std::min(page, lowestPage)});
+                if (last == out.size()) {
+                    uint64_t lowest = UINT64_MAX;
+                    lookUp(run.first + i, &lowest);
+                    const uint64_t page = run.page + i;
+                    out.push_back(SetPages{set, 0, 0, page, std::min(page, lowest)});
                 }
-                (swapped ? entry->swappedPages : entry->presentPages) += count;
-            };
-            if (frozen) {
-                _setsOf(shard, first, length, add);
-                return;
             }
-            // While pages are still added: the shard's lock here, the sets'
-            // lock below, never both (adding takes them nested the other
-            // way round).
-            std::lock_guard<std::mutex> lock(_shards[shard].mutex);
-            _setsOf(shard, first, length, add);
-        });
+            (swapped ? out[last].swappedPages : out[last].presentPages) += 1;
+        }
     }
     std::unique_lock<std::mutex> lock(_mutex, std::defer_lock);
     if (!frozen) {

@@ -140,32 +140,27 @@ private:
     // one shard each.
     template <typename Piece>
     static void _forEachPiece(const KeyRun &run, Piece &&piece);
-    // The set of every page of [first, first + length) in `shard`, to
-    // `each(set, count, skipped, lowestPage)` by stretches of pages in the
-    // same set: `skipped` pages of the piece before the stretch, and the
-    // lowest virtual page of its first page.
-    template <typename Each>
-    void _setsOf(size_t shard, uint64_t first, uint64_t length, Each &&each) const;
-    // What the index knows of one key: its set, and the lowest virtual
-    // page at which a target maps it.
-    struct Lane {
-        uint32_t set = 0;
-        int32_t lastPid = 0; // the target that added it last: a page it adds twice is still one
-        uint64_t lowestPage = UINT64_MAX;
-    };
+    // What the index knows of each key: its set, and apart (read far
+    // less often) the lowest virtual page at which a target maps it.
     class PageTable {
     public:
         static constexpr size_t kLanes = size_t{1} << kBlockShift;
-        // The lanes of a block's keys, or null when none was added.
-        const Lane *find(uint64_t block) const;
+        static constexpr size_t kNoSlot = SIZE_MAX;
+        // The slot of a block's keys, or kNoSlot when none was added.
+        size_t find(uint64_t block) const;
         // The same, made when missing; valid until the next call.
-        Lane *findOrAdd(uint64_t block);
+        size_t findOrAdd(uint64_t block);
+        uint32_t *sets(size_t slot) { return &_sets[slot * kLanes]; }
+        const uint32_t *sets(size_t slot) const { return &_sets[slot * kLanes]; }
+        uint64_t *lowestPages(size_t slot) { return &_lowest[slot * kLanes]; }
+        const uint64_t *lowestPages(size_t slot) const { return &_lowest[slot * kLanes]; }
         void clear();
 
     private:
         void _grow();
         std::vector<uint64_t> _blocks; // block + 1; 0: a free slot
-        std::vector<Lane> _lanes;      // kLanes per slot
+        std::vector<uint32_t> _sets;   // kLanes per slot
+        std::vector<uint64_t> _lowest; // kLanes per slot
         size_t _count = 0;
     };
 
