@@ -77,6 +77,10 @@ TEST(SharedPageIndex, RunsAreCountedBySetAsTheIndexGrows) {
     index.addPages(1, parent);
     index.addPages(2, child);
     index.addPages(3, std::vector<vs::KeyRun>{{child[10].first + 2, 7, 0x100}});
+    // Where each one's mapping of those pages begins.
+    index.notePlace(child[0].first, child[0].page - kMoved);
+    index.notePlace(child[0].first, child[0].page);
+    index.notePlace(child[10].first + 2, 0x100);
     for (const bool frozen : {false, true}) {
         SCOPED_TRACE(frozen ? "frozen" : "still adding");
         if (frozen) {

@@ -1207,6 +1207,9 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
             runs.clear();
             _candidateKeys(pagemap.get(), region, runs, &framesUnreadable);
             allRuns.insert(allRuns.end(), runs.begin(), runs.end());
+            if (!runs.empty()) {
+                _sharedPages.notePlace(runs.front().first, runs.front().page);
+            }
             const size_t before = task->storedBytes.size();
             vs::encodeKeyRuns(runs, task->storedBytes);
             task->storedKeys.push_back({region.start, region.end, before, task->storedBytes.size() - before});

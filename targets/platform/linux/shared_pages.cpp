@@ -119,7 +119,6 @@ size_t SharedPageIndex::PageTable::findOrAdd(uint64_t block) {
 void SharedPageIndex::PageTable::_grow() {
     std::vector<uint64_t> blocks(std::max<size_t>(1024, _blocks.size() * 2), 0);
     std::vector<uint32_t> sets(blocks.size() * kLanes, 0);
-    std::vector<uint64_t> lowest(blocks.size() * kLanes, UINT64_MAX);
     const size_t mask = blocks.size() - 1;
     for (size_t i = 0; i < _blocks.size(); ++i) {
         if (_blocks[i] != 0) {
@@ -129,18 +128,15 @@ void SharedPageIndex::PageTable::_grow() {
             }
             blocks[slot] = _blocks[i];
             std::copy_n(&_sets[i * kLanes], kLanes, &sets[slot * kLanes]);
-            std::copy_n(&_lowest[i * kLanes], kLanes, &lowest[slot * kLanes]);
         }
     }
     _blocks.swap(blocks);
     _sets.swap(sets);
-    _lowest.swap(lowest);
 }
 
 void SharedPageIndex::PageTable::clear() {
     std::vector<uint64_t>().swap(_blocks);
     std::vector<uint32_t>().swap(_sets);
-    std::vector<uint64_t>().swap(_lowest);
     _count = 0;
 }
 
@@ -233,12 +229,9 @@ void SharedPageIndex::addPages(int32_t pid, std::span<const KeyRun> runs) {
                 PageTable &table = _shards[shard].pages;
                 const size_t slot = table.findOrAdd(key >> kBlockShift);
                 uint32_t *sets = table.sets(slot);
-                uint64_t *lowest = table.lowestPages(slot);
                 const uint64_t lane = key & (PageTable::kLanes - 1);
                 const uint64_t count = std::min<uint64_t>(left, PageTable::kLanes - lane);
-                const uint64_t page = piece.page + (key - piece.first);
                 for (uint64_t k = lane; k < lane + count; ++k) {
-                    lowest[k] = std::min(lowest[k], page + (k - lane));
                     if (sets[k] != lastFrom) {
                         lastFrom = sets[k];
                         lastTo = step(lastFrom);
@@ -262,13 +255,12 @@ std::optional<uint32_t> SharedPageIndex::sharedSet(uint64_t key) const {
 void SharedPageIndex::sharedPages(std::span<const KeyRun> runs, std::vector<SetPages> &out) const {
     out.clear();
     const bool frozen = _frozen.load();
-    // The set of a key and, when asked, the lowest page it is mapped at.
-    // While pages are still added: the shard's lock here, the sets' lock
+    // The set of a key. While pages are still added: the shard's lock here, the sets' lock
     // below, never both (adding takes them nested the other way round).
     uint64_t lastBlock = UINT64_MAX;
     size_t slot = PageTable::kNoSlot;
     const PageTable *table = nullptr;
-    auto lookUp = [&](uint64_t key, uint64_t *lowest) {
+    auto lookUp = [&](uint64_t key) {
         Shard &shard = _shards[_shardOf(key)];
         std::unique_lock<std::mutex> lock(shard.mutex, std::defer_lock);
         if (!frozen) {
@@ -280,11 +272,7 @@ void SharedPageIndex::sharedPages(std::span<const KeyRun> runs, std::vector<SetP
             table = &shard.pages;
             slot = table->find(key >> kBlockShift);
         }
-        const size_t lane = key & (PageTable::kLanes - 1);
-        if (lowest != nullptr) {
-            *lowest = slot == PageTable::kNoSlot ? UINT64_MAX : table->lowestPages(slot)[lane];
-        }
-        return slot == PageTable::kNoSlot ? 0u : table->sets(slot)[lane];
+        return slot == PageTable::kNoSlot ? 0u : table->sets(slot)[key & (PageTable::kLanes - 1)];
     };
     // A region meets few sets, mostly one after the other: the last entry
     // first, then a short list.
@@ -292,17 +280,15 @@ void SharedPageIndex::sharedPages(std::span<const KeyRun> runs, std::vector<SetP
     for (const KeyRun &run : runs) {
         const bool swapped = (run.first & kSwapKey) != 0;
         for (uint64_t i = 0; i < run.length; ++i) {
-            const uint32_t set = lookUp(run.first + i, nullptr);
+            const uint32_t set = lookUp(run.first + i);
             if (last == SIZE_MAX || out[last].set != set) {
                 last = 0;
                 while (last < out.size() && out[last].set != set) {
                     ++last;
                 }
                 if (last == out.size()) {
-                    uint64_t lowest = UINT64_MAX;
-                    lookUp(run.first + i, &lowest);
                     const uint64_t page = run.page + i;
-                    out.push_back(SetPages{set, 0, 0, page, std::min(page, lowest)});
+                    out.push_back(SetPages{set, 0, 0, page, std::min(page, _placeOf(run.first + i, frozen))});
                 }
             }
             (swapped ? out[last].swappedPages : out[last].presentPages) += 1;
@@ -313,6 +299,21 @@ void SharedPageIndex::sharedPages(std::span<const KeyRun> runs, std::vector<SetP
         lock.lock();
     }
     std::erase_if(out, [&](const SetPages &entry) { return _sets[entry.set].size < 2; });
+}
+
+void SharedPageIndex::notePlace(uint64_t key, uint64_t page) {
+    std::lock_guard<std::mutex> lock(_mutex);
+    auto [entry, added] = _places.try_emplace(key, page);
+    entry->second = std::min(entry->second, page);
+}
+
+uint64_t SharedPageIndex::_placeOf(uint64_t key, bool frozen) const {
+    std::unique_lock<std::mutex> lock(_mutex, std::defer_lock);
+    if (!frozen) {
+        lock.lock();
+    }
+    const auto found = _places.find(key);
+    return found == _places.end() ? UINT64_MAX : found->second;
 }
 
 std::vector<int32_t> SharedPageIndex::setMembers(uint32_t set) const {
@@ -365,6 +366,7 @@ void SharedPageIndex::clear() {
     _sets.assign(1, SetEntry{});
     _setIds = {{SetKey{0, 0, 0}, 0}};
     _transitions.clear();
+    _places.clear();
     _objects.clear();
     for (Shard &shard : _shards) {
         std::lock_guard<std::mutex> shardLock(shard.mutex);

@@ -70,8 +70,12 @@ struct ObjectPages {
 class SharedPageIndex {
 public:
     // The pages of a target that other targets may map too (keys as
-    // above). A target may add in several calls.
+    // above), all at once: a page the target maps twice is still one member.
     void addPages(int32_t pid, std::span<const KeyRun> runs);
+    // Where a mapping's first page that others may map too lies: members of
+    // a fork family place their copies where the lowest of them has them,
+    // so that a copy one of them moved (mremap) stays one object.
+    void notePlace(uint64_t key, uint64_t page);
 
     // The set of targets mapping the page when it has more than one
     // member; nullopt for a page one target alone maps.
@@ -79,7 +83,7 @@ public:
     // How many of the pages of `runs` lie in each set of more than one
     // target, swapped pages apart; pages of one target alone are left out.
     // Of the first page met in each set: the virtual page it is mapped at in
-    // `runs`, and the lowest virtual page any target maps it at (where a
+    // `runs`, and the lowest virtual page any target noted for it (where a
     // member moved its copy with mremap, the two differ).
     struct SetPages {
         uint32_t set = 0;
@@ -130,6 +134,7 @@ private:
     };
 
     uint32_t _setWith(uint32_t set, int32_t pid);
+    uint64_t _placeOf(uint64_t key, bool frozen) const;
 
     // Page key -> set, by blocks of 8 neighbouring keys (a process's
     // frames come in runs, so one probe serves several pages): open
@@ -140,8 +145,6 @@ private:
     // one shard each.
     template <typename Piece>
     static void _forEachPiece(const KeyRun &run, Piece &&piece);
-    // What the index knows of each key: its set, and apart (read far
-    // less often) the lowest virtual page at which a target maps it.
     class PageTable {
     public:
         static constexpr size_t kLanes = size_t{1} << kBlockShift;
@@ -152,15 +155,12 @@ private:
         size_t findOrAdd(uint64_t block);
         uint32_t *sets(size_t slot) { return &_sets[slot * kLanes]; }
         const uint32_t *sets(size_t slot) const { return &_sets[slot * kLanes]; }
-        uint64_t *lowestPages(size_t slot) { return &_lowest[slot * kLanes]; }
-        const uint64_t *lowestPages(size_t slot) const { return &_lowest[slot * kLanes]; }
         void clear();
 
     private:
         void _grow();
         std::vector<uint64_t> _blocks; // block + 1; 0: a free slot
         std::vector<uint32_t> _sets;   // kLanes per slot
-        std::vector<uint64_t> _lowest; // kLanes per slot
         size_t _count = 0;
     };
 
@@ -202,6 +202,7 @@ private:
     std::vector<SetEntry> _sets{SetEntry{}};
     std::unordered_map<SetKey, uint32_t, SetKeyHash> _setIds{{SetKey{0, 0, 0}, 0}};
     std::unordered_map<uint64_t, uint32_t> _transitions; // (set << 32 | pid) -> set
+    std::unordered_map<uint64_t, uint64_t> _places;      // key -> lowest page noted
     std::map<std::tuple<uint64_t, uint64_t, bool>, ObjectBits> _objects; // device, inode, private
 };
 
