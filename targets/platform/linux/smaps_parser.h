@@ -84,6 +84,9 @@ public:
     size_t size() const { return _text != nullptr ? _text->size() : 0; }
     char operator[](size_t i) const { return (*_text)[i]; }
     friend bool operator==(const MappingPath &a, std::string_view b) { return std::string_view(a) == b; }
+    friend bool operator==(const MappingPath &a, const MappingPath &b) {
+        return std::string_view(a) == std::string_view(b);
+    }
 
 private:
     const std::string *_text = nullptr;
