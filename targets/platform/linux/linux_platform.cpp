@@ -119,6 +119,11 @@ struct VSLinuxPlatform::Task {
         }
         return ProcessDir::opened(std::move(opened));
     }
+    // Invalid when the process cannot be reached or its frames not read.
+    UniqueFd openPagemap() const {
+        const ProcessDir at = openDir();
+        return UniqueFd(at.get() < 0 ? -1 : ::openat(at.get(), "pagemap", O_RDONLY | O_CLOEXEC));
+    }
 
     std::mutex mutex; // guards everything below
     // smaps, opened with the handle (the open is where the kernel checks
@@ -966,7 +971,7 @@ void VSLinuxPlatform::_buildParts(Task &task) {
                                   runs);
             } else {
                 if (!pagemap.valid()) {
-                    pagemap = UniqueFd(::openat(task.openDir().get(), "pagemap", O_RDONLY | O_CLOEXEC));
+                    pagemap = task.openPagemap();
                     pagemapFailed = !pagemap.valid();
                 }
                 if (pagemap.valid()) {
@@ -984,7 +989,7 @@ void VSLinuxPlatform::_buildParts(Task &task) {
                 shared.push_back({ids.idForFrameSet(set.set, start), start, set.presentPages, set.swappedPages});
             }
         }
-        if (resolved && (_isSharedWindow(region, kind) || _isPrivateWindow(region, kind))) {
+        if (resolved && vs::isFileWindow(region, kind, _pageSize)) {
             objectPages = _sharedPages.objectPages(vs::objectDevice(region), region.inode, !region.shared,
                                                    region.offset / _pageSize, region.size() / _pageSize);
         }
@@ -1001,11 +1006,6 @@ void VSLinuxPlatform::_buildParts(Task &task) {
     }
     std::vector<Task::StoredKeys>().swap(task.storedKeys);
     std::vector<uint8_t>().swap(task.storedBytes);
-}
-
-bool VSLinuxPlatform::_isSharedWindow(const SmapsRegion &region, vs::MappingKind kind) const {
-    return region.shared && region.inode != 0 && !region.hasFlag(vs::kVmHugetlb) &&
-           (kind == vs::MappingKind::File || kind == vs::MappingKind::SharedMemory);
 }
 
 void VSLinuxPlatform::_candidateKeys(int pagemapFd, const SmapsRegion &region, std::vector<vs::KeyRun> &runs,
@@ -1191,12 +1191,12 @@ bool VSLinuxPlatform::prepare_task_walk(VSTaskHandle handle) {
         const SmapsRegion &region = task->regions[i];
         const vs::MappingKind kind = task->kinds[i];
         const bool anonymous = vs::mayShareAnonymousPages(region, kind);
-        const bool window = _isSharedWindow(region, kind) || _isPrivateWindow(region, kind);
+        const bool window = vs::isFileWindow(region, kind, _pageSize);
         if (!anonymous && !window) {
             continue;
         }
         if (!pagemap.valid()) {
-            pagemap = UniqueFd(::openat(task->openDir().get(), "pagemap", O_RDONLY | O_CLOEXEC));
+            pagemap = task->openPagemap();
             if (!pagemap.valid()) {
                 // The walk reports the process; nothing to share from it.
                 return false;
@@ -1250,7 +1250,7 @@ bool VSLinuxPlatform::_addWindow(int pagemapFd, const SmapsRegion &region, vs::M
     pages.privateMapping = !region.shared;
     pages.firstPage = region.offset / _pageSize;
     pages.pageCount = region.size() / _pageSize;
-    const uint64_t filePages = _filePages(region);
+    const uint64_t filePages = vs::filePages(region, _pageSize);
     pages.dirtyCount = vs::fileDirtyPages(region, _pageSize);
     const bool shmem = kind == vs::MappingKind::SharedMemory;
     const bool whole = filePages == pages.pageCount;
@@ -1285,16 +1285,6 @@ bool VSLinuxPlatform::_addWindow(int pagemapFd, const SmapsRegion &region, vs::M
     // A mapping holding its whole range is exact on its own: its walk need
     // not wait for the others' pages.
     return !whole;
-}
-
-uint64_t VSLinuxPlatform::_filePages(const SmapsRegion &region) const {
-    const uint64_t resident = region.rss / _pageSize;
-    return region.shared ? resident : resident - std::min(resident, region.anonymous / _pageSize);
-}
-
-bool VSLinuxPlatform::_isPrivateWindow(const SmapsRegion &region, vs::MappingKind kind) const {
-    return !region.shared && region.inode != 0 && !region.hasFlag(vs::kVmHugetlb) &&
-           (kind == vs::MappingKind::File || kind == vs::MappingKind::SharedMemory) && _filePages(region) > 0;
 }
 
 void VSLinuxPlatform::_forEachDirtyFrame(std::vector<std::pair<uint64_t, uint64_t>> &frames,

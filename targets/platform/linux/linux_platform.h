@@ -121,12 +121,6 @@ private:
     // The records of every region's parts, from the parse and, once the
     // run's shared pages are resolved, the shared-page index.
     void _buildParts(Task &task);
-    bool _isSharedWindow(const vs::SmapsRegion &region, vs::MappingKind kind) const;
-    // A private file mapping showing page cache: several processes may
-    // hold different pages of the same window.
-    bool _isPrivateWindow(const vs::SmapsRegion &region, vs::MappingKind kind) const;
-    // Page cache pages (not copies) the mapping holds.
-    uint64_t _filePages(const vs::SmapsRegion &region) const;
     // Adds the file pages a shared or private window holds to the index;
     // true when the mapping's own counts may fall short of the object's.
     bool _addWindow(int pagemapFd, const vs::SmapsRegion &region, vs::MappingKind kind);

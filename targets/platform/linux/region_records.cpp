@@ -7,9 +7,7 @@
 #include <algorithm>
 #include <string>
 #include <string_view>
-#include <tuple>
 #include <type_traits>
-#include <utility>
 
 namespace vs {
 
@@ -100,6 +98,17 @@ uint32_t userTagFor(const SmapsRegion &region, MappingKind kind,
         return kTagJitCode;
     }
     return 0;
+}
+
+uint64_t filePages(const SmapsRegion &region, uint64_t pageSize) {
+    const uint64_t resident = region.rss / pageSize;
+    return region.shared ? resident : resident - std::min<uint64_t>(resident, region.anonymous / pageSize);
+}
+
+bool isFileWindow(const SmapsRegion &region, MappingKind kind, uint64_t pageSize) {
+    return region.inode != 0 && !region.hasFlag(kVmHugetlb) &&
+           (kind == MappingKind::File || kind == MappingKind::SharedMemory) &&
+           (region.shared || filePages(region, pageSize) > 0);
 }
 
 uint64_t fileDirtyPages(const SmapsRegion &region, uint64_t pageSize) {
@@ -238,18 +247,17 @@ std::vector<VSRegionInfo> regionPartsFor(const SmapsRegion &region, MappingKind 
     const uint64_t ownPresent = clampedDifference(anonymous, sharedPresent);
     const uint64_t ownSwapped = clampedDifference(pages(region.swap), sharedSwapped);
     if (hasFile) {
-        const bool holdsFilePages = resident > anonymous;
-        uint64_t filePages = resident - anonymous;
-        uint64_t fileDirty = fileDirtyPages(region, pageSize);
-        if (objectPages && holdsFilePages) {
+        uint64_t cached = filePages(region, pageSize);
+        uint64_t cachedDirty = fileDirtyPages(region, pageSize);
+        if (objectPages && cached > 0) {
             // Other mappings of the window hold other pages of it.
-            filePages = objectPages->residentPages;
-            fileDirty = objectPages->dirtyPages;
+            cached = objectPages->residentPages;
+            cachedDirty = objectPages->dirtyPages;
         }
         // Always first, even when every page is a copy: the walk names a
         // mapping's parts after the file its first part is backed by.
         const uint32_t id = ids.idForFileWindow(device, region.inode, region.offset);
-        parts.push_back(part(common, region, id, region.offset, {filePages, fileDirty, 0, 0}, droppable,
+        parts.push_back(part(common, region, id, region.offset, {cached, cachedDirty, 0, 0}, droppable,
                              kShareModeShared));
     }
     if (ownPresent + ownSwapped > 0 || (parts.empty() && sharedPresent + sharedSwapped == 0)) {

@@ -32,8 +32,14 @@ struct SharedAnonymousPart {
     uint64_t swappedPages = 0;
 };
 
-// Dirty page cache pages of a mapping (its copies left out).
+// Page cache pages of a mapping, and how many of them are dirty (a private
+// mapping's own copies left out).
+uint64_t filePages(const SmapsRegion &region, uint64_t pageSize);
 uint64_t fileDirtyPages(const SmapsRegion &region, uint64_t pageSize);
+
+// Does the mapping show page cache of a file (or shmem object) that other
+// mappings may hold other pages of? Such windows count the union.
+bool isFileWindow(const SmapsRegion &region, MappingKind kind, uint64_t pageSize);
 
 // Does the mapping hold anonymous pages that may be mapped by other
 // processes too? Only such mappings need their frames looked up.

@@ -161,11 +161,11 @@ uint32_t SharedPageIndex::_setWith(uint32_t set, int32_t pid) {
     if (set != 0 && from.added == pid) {
         return set; // a page the target maps twice: still one member
     }
-    const SetKey key{from.size + 1, from.sum1 + mixed(pid, 0x9E3779B97F4A7C15ull),
-                     from.sum2 + mixed(pid, 0xD1B54A32D192ED03ull)};
+    const SetKey key{from.key.size + 1, from.key.sum1 + mixed(pid, 0x9E3779B97F4A7C15ull),
+                     from.key.sum2 + mixed(pid, 0xD1B54A32D192ED03ull)};
     auto [entry, added] = _setIds.try_emplace(key, static_cast<uint32_t>(_sets.size()));
     if (added) {
-        _sets.push_back(SetEntry{key.size, set, pid, key.sum1, key.sum2});
+        _sets.push_back(SetEntry{key, set, pid});
     }
     _transitions.emplace(transition, entry->second);
     return entry->second;
@@ -255,24 +255,27 @@ std::optional<uint32_t> SharedPageIndex::sharedSet(uint64_t key) const {
 void SharedPageIndex::sharedPages(std::span<const KeyRun> runs, std::vector<SetPages> &out) const {
     out.clear();
     const bool frozen = _frozen.load();
-    // The set of a key. While pages are still added: the shard's lock here, the sets' lock
-    // below, never both (adding takes them nested the other way round).
+    // The set of a key. Once frozen, the table of the last block asked for
+    // serves its neighbours. While pages are still added: the shard's lock
+    // here, the sets' lock below, never both (adding takes them nested the
+    // other way round).
     uint64_t lastBlock = UINT64_MAX;
-    size_t slot = PageTable::kNoSlot;
-    const PageTable *table = nullptr;
-    auto lookUp = [&](uint64_t key) {
+    const uint32_t *lastSets = nullptr;
+    auto lookUp = [&](uint64_t key) -> uint32_t {
+        const uint64_t block = key >> kBlockShift;
+        const size_t lane = key & (PageTable::kLanes - 1);
         Shard &shard = _shards[_shardOf(key)];
-        std::unique_lock<std::mutex> lock(shard.mutex, std::defer_lock);
         if (!frozen) {
-            lock.lock();
-            lastBlock = UINT64_MAX; // a table still growing moves its slots
+            std::lock_guard<std::mutex> lock(shard.mutex);
+            const size_t slot = shard.pages.find(block);
+            return slot == PageTable::kNoSlot ? 0 : shard.pages.sets(slot)[lane];
         }
-        if ((key >> kBlockShift) != lastBlock) {
-            lastBlock = frozen ? key >> kBlockShift : UINT64_MAX;
-            table = &shard.pages;
-            slot = table->find(key >> kBlockShift);
+        if (block != lastBlock) {
+            const size_t slot = shard.pages.find(block);
+            lastBlock = block;
+            lastSets = slot == PageTable::kNoSlot ? nullptr : shard.pages.sets(slot);
         }
-        return slot == PageTable::kNoSlot ? 0u : table->sets(slot)[key & (PageTable::kLanes - 1)];
+        return lastSets == nullptr ? 0 : lastSets[lane];
     };
     // A region meets few sets, mostly one after the other: the last entry
     // first, then a short list.
@@ -298,7 +301,7 @@ void SharedPageIndex::sharedPages(std::span<const KeyRun> runs, std::vector<SetP
     if (!frozen) {
         lock.lock();
     }
-    std::erase_if(out, [&](const SetPages &entry) { return _sets[entry.set].size < 2; });
+    std::erase_if(out, [&](const SetPages &entry) { return _sets[entry.set].key.size < 2; });
 }
 
 void SharedPageIndex::notePlace(uint64_t key, uint64_t page) {
@@ -364,7 +367,7 @@ std::optional<ObjectPages> SharedPageIndex::objectPages(uint64_t device, uint64_
 void SharedPageIndex::clear() {
     std::lock_guard<std::mutex> lock(_mutex);
     _sets.assign(1, SetEntry{});
-    _setIds = {{SetKey{0, 0, 0}, 0}};
+    _setIds = {{SetKey{}, 0}};
     _transitions.clear();
     _places.clear();
     _objects.clear();

@@ -185,22 +185,21 @@ private:
     // listed: a set is known by its size and two sums of its members'
     // hashes (the same in whatever order they came), and keeps the set it
     // was first made from and the member added to it. Set 0 is the empty set.
-    struct SetEntry {
-        uint32_t size = 0;
-        uint32_t from = 0;
-        int32_t added = 0;
-        uint64_t sum1 = 0, sum2 = 0;
-    };
     struct SetKey {
-        uint32_t size;
-        uint64_t sum1, sum2;
+        uint32_t size = 0;
+        uint64_t sum1 = 0, sum2 = 0;
         bool operator==(const SetKey &) const = default;
     };
     struct SetKeyHash {
         size_t operator()(const SetKey &key) const { return static_cast<size_t>(key.sum1 ^ (key.sum2 >> 7) ^ key.size); }
     };
+    struct SetEntry {
+        SetKey key;
+        uint32_t from = 0;
+        int32_t added = 0;
+    };
     std::vector<SetEntry> _sets{SetEntry{}};
-    std::unordered_map<SetKey, uint32_t, SetKeyHash> _setIds{{SetKey{0, 0, 0}, 0}};
+    std::unordered_map<SetKey, uint32_t, SetKeyHash> _setIds{{SetKey{}, 0}};
     std::unordered_map<uint64_t, uint32_t> _transitions; // (set << 32 | pid) -> set
     std::unordered_map<uint64_t, uint64_t> _places;      // key -> lowest page noted
     std::map<std::tuple<uint64_t, uint64_t, bool>, ObjectBits> _objects; // device, inode, private
